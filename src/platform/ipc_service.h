@@ -33,7 +33,10 @@ struct Message {
 };
 
 // The reply to `message`, with an empty body; none when `message` is itself a reply.
-std::optional<Message> CreateReply(const Message& message);
+inline std::optional<Message> CreateReply(const Message& message) {
+  if (message.isReply) return std::nullopt;
+  return Message{{}, message.replyToken, true};
+}
 
 // What a connection's or listener's handler is told.
 enum class EventKind {
