@@ -11,6 +11,7 @@
 #pragma once
 
 #include <cstdint>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -52,7 +53,7 @@ void SetDebugEnabled(bool enabled);
 bool DebugEnabled();
 
 // Records every line (debug included) while it is alive; restores the previous sink
-// and debug setting when it goes.
+// and debug setting when it goes. Lines may arrive from any thread.
 class CaptureSink : public Sink {
  public:
   CaptureSink();
@@ -69,6 +70,7 @@ class CaptureSink : public Sink {
  private:
   Sink* previous_;
   bool previousDebug_;
+  mutable std::mutex mutex_;
   std::vector<Line> lines_;
 };
 

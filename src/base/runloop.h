@@ -9,6 +9,7 @@
 // removes the source, also from inside its own callback.
 #pragma once
 
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <cstdint>
@@ -69,10 +70,10 @@ class RunLoop {
 
   // Runs until Stop(). Returns at once if Stop() was called before.
   void Run();
-  // Runs until `done` returns true (checked after every dispatched event) or the
-  // timeout passes; returns done().
+  // Runs until `done` returns true (checked after every dispatched event), the
+  // timeout passes or Stop() is called; returns done().
   bool RunUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout);
-  // Runs for a bounded time, then returns.
+  // Runs for a bounded time (or until Stop()), then returns.
   void RunFor(std::chrono::milliseconds duration);
   // Dispatches what is ready now without waiting; returns the number of events handled.
   int RunOnce();
@@ -82,12 +83,13 @@ class RunLoop {
   friend class SourceHandle;
   struct Source;
   void Remove(uint64_t id);
-  int Dispatch(int timeoutMs);
-  void DrainMainQueue();
+  // Handles what is ready (waiting up to timeoutMs for something), returning early once
+  // `done` says so; what is left stays pending for the next call.
+  int Dispatch(int timeoutMs, const std::function<bool()>* done = nullptr);
 
   int epollFd_ = -1;
   int wakeFd_ = -1;
-  bool stopped_ = false;
+  std::atomic<bool> stopped_ = false;
   uint64_t nextId_ = 1;
   std::map<uint64_t, std::shared_ptr<Source>> sources_;
   std::mutex queueMutex_;
