@@ -1,0 +1,111 @@
+// brisvale-mounterd: the composition root. Builds the Linux implementations of the
+// platform interfaces, optionally enters a sandbox root, and runs the daemon.
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <optional>
+#include <string>
+
+#include "base/log.h"
+#include "base/runloop.h"
+#include "daemon/daemon.h"
+#include "daemon/matching_context.h"
+#include "daemon/stale_mount_points.h"
+#include "platform/linux/ipc_linux.h"
+#include "platform/linux/os_sandbox.h"
+
+namespace {
+
+constexpr int kExitUsage = 2;
+constexpr int kExitSetup = 3;
+
+struct Options {
+  std::optional<std::string> root;
+  std::optional<std::string> devicesFile;
+  bool teardown = false;
+  bool verbose = false;
+};
+
+void PrintUsage(FILE* out) {
+  std::fputs(
+      "usage: brisvale-mounterd [--root DIR [--teardown]] [--devices FILE] [--verbose]\n"
+      "  --root DIR      run chrooted in the sandbox root DIR (made ready first)\n"
+      "  --teardown      with --root: unmount everything under DIR, detach its loop\n"
+      "                  devices and remove DIR, then exit\n"
+      "  --devices FILE  publish the simulated devices described in FILE\n"
+      "  --verbose       log debug lines\n",
+      out);
+}
+
+std::optional<Options> ParseOptions(int argc, char** argv) {
+  Options options;
+  for (int i = 1; i < argc; ++i) {
+    std::string arg = argv[i];
+    auto value = [&]() -> std::optional<std::string> {
+      if (i + 1 >= argc) return std::nullopt;
+      return std::string(argv[++i]);
+    };
+    if (arg == "--root") {
+      if (!(options.root = value())) return std::nullopt;
+    } else if (arg == "--devices") {
+      if (!(options.devicesFile = value())) return std::nullopt;
+    } else if (arg == "--teardown") {
+      options.teardown = true;
+    } else if (arg == "--verbose" || arg == "-v") {
+      options.verbose = true;
+    } else if (arg == "--help" || arg == "-h") {
+      PrintUsage(stdout);
+      std::exit(0);
+    } else {
+      std::fprintf(stderr, "brisvale-mounterd: unknown argument '%s'\n", arg.c_str());
+      return std::nullopt;
+    }
+  }
+  if (options.teardown && !options.root) return std::nullopt;
+  return options;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  using namespace brisvale;
+  std::optional<Options> options = ParseOptions(argc, argv);
+  if (!options) {
+    PrintUsage(stderr);
+    return kExitUsage;
+  }
+  if (options->verbose || std::getenv("BRISVALE_DEBUG")) log::SetDebugEnabled(true);
+  std::signal(SIGPIPE, SIG_IGN);
+
+  std::string error;
+  if (options->root && options->teardown) {
+    if (!linux_os::TeardownSandboxRoot(*options->root, &error)) {
+      std::fprintf(stderr, "brisvale-mounterd: teardown of %s failed: %s\n",
+                   options->root->c_str(), error.c_str());
+      return kExitSetup;
+    }
+    return 0;
+  }
+  if (options->root) {
+    if (!linux_os::EnterSandboxRoot(*options->root, &error)) {
+      std::fprintf(stderr, "brisvale-mounterd: cannot use %s as sandbox root: %s\n",
+                   options->root->c_str(), error.c_str());
+      return kExitSetup;
+    }
+  } else if (!linux_os::CheckFilesystemLayout(&error)) {
+    std::fprintf(stderr, "brisvale-mounterd: %s\n", error.c_str());
+    return kExitSetup;
+  }
+
+  RunLoop loop;
+  MatchingContext context;
+
+  for (const char* root : kStaleMountRoots) RemoveStaleMountPoints(root);
+
+  std::unique_ptr<ipc::IpcService> ipc = CreateLinuxIpcService(loop, IpcOptions{});
+  Daemon daemon(loop, *ipc, context, [](int status) { std::exit(status); });
+  if (!daemon.StartServing()) return 1;
+  loop.Run();
+  return 0;
+}

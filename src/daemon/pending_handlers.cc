@@ -1,0 +1,17 @@
+// Handlers whose subsystems are not built yet. A request routed here keeps the
+// dispatcher's preset "Failure"; a hardware event routed here is only logged by the
+// event handler.
+#include "daemon/request_handlers.h"
+
+namespace brisvale {
+
+void HandleCopyDevices(const plist::Value&, plist::Dictionary&) {}
+void HandleMountRequest(MatchingContext&, const plist::Value&, plist::Dictionary&) {}
+void HandleUnmount(const plist::Value&, plist::Dictionary&) {}
+void HandleSync(const plist::Value&, plist::Dictionary&) {}
+
+void SubscribeMediaAttach(MatchingContext&) {}
+void SubscribeCameraAttach(MatchingContext&) {}
+void HandleMediaDetached() {}
+
+}  // namespace brisvale

@@ -1,0 +1,21 @@
+// The request and hardware-event handlers the dispatcher and the event stream route to.
+// Each request handler reads the decoded request and leaves its outcome in the reply,
+// whose "Status" the dispatcher has preset to "Failure".
+#pragma once
+
+#include "base/plist.h"
+#include "daemon/matching_context.h"
+
+namespace brisvale {
+
+void HandleCopyDevices(const plist::Value& request, plist::Dictionary& reply);
+void HandleMountRequest(MatchingContext& context, const plist::Value& request,
+                        plist::Dictionary& reply);
+void HandleUnmount(const plist::Value& request, plist::Dictionary& reply);
+void HandleSync(const plist::Value& request, plist::Dictionary& reply);
+
+void SubscribeMediaAttach(MatchingContext& context);
+void SubscribeCameraAttach(MatchingContext& context);
+void HandleMediaDetached();
+
+}  // namespace brisvale

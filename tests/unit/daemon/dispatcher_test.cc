@@ -1,0 +1,186 @@
+#include "daemon/dispatcher.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "base/log.h"
+#include "fake_connection.h"
+
+namespace brisvale {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::IsEmpty;
+using testing::FakeConnection;
+
+constexpr const char* kMissingEntitlement =
+    "Missing required entitlement (will be required in <kelpie://problem/25909614>): ";
+
+ipc::Message RequestCarrying(plist::Value encoded, std::optional<int64_t> id = 7) {
+  ipc::Message message;
+  message.body.set("EncodedDictionary", std::move(encoded));
+  if (id) message.replyToken = plist::Integer{*id, false};
+  return message;
+}
+
+ipc::Message Request(const plist::Value& dictionary) {
+  return RequestCarrying(plist::Value(plist::WriteBinary(dictionary)));
+}
+
+plist::Value AllSPIs() {
+  return plist::Array{"CopyDevices", "MountDevice", "UnmountDevice", "SyncDevice"};
+}
+
+std::vector<std::string> DefaultLines(const log::CaptureSink& capture) {
+  std::vector<std::string> texts;
+  for (const log::Line& line : capture.Lines()) {
+    if (line.level == Level::Default) texts.push_back(line.text);
+  }
+  return texts;
+}
+
+struct Rejection {
+  const char* name;
+  ipc::Message message;
+  const char* line;
+};
+
+TEST(HandleRequest, MalformedRequestsAreRejectedWithTheirLine) {
+  plist::Bytes xmlArray;
+  std::string xml = plist::WriteXml(plist::Array{"CopyDevices"});
+  xmlArray.assign(xml.begin(), xml.end());
+  const Rejection cases[] = {
+      {"no encoded dictionary", ipc::Message{}, "Invalid or missing value for EncodedDictionary."},
+      {"encoded dictionary is text", RequestCarrying("RequestType"),
+       "Invalid or missing value for EncodedDictionary."},
+      {"undecodable bytes", RequestCarrying(plist::Bytes{'b', 'p', 'l', 'i', 's', 't', '0', '0', 1}),
+       "Failed to create dictionary with data."},
+      {"top level is an array", RequestCarrying(plist::Value(xmlArray)),
+       "Invalid value for RequestType: (null)"},
+      {"no request type", Request(plist::Dictionary{{"Other", "x"}}),
+       "Invalid value for RequestType: (null)"},
+      {"request type not text", Request(plist::Dictionary{{"RequestType", plist::Value::Int(3)}}),
+       "Invalid value for RequestType: 3"},
+      {"operation name is not a request type",
+       Request(plist::Dictionary{{"RequestType", "MountDevice"}}),
+       "Invalid request type: MountDevice"},
+      {"case matters", Request(plist::Dictionary{{"RequestType", "copydevices"}}),
+       "Invalid request type: copydevices"},
+  };
+  for (const Rejection& c : cases) {
+    SCOPED_TRACE(c.name);
+    log::CaptureSink capture;
+    FakeConnection connection;
+    connection.allowedSPI = AllSPIs();
+    MatchingContext context;
+    EXPECT_FALSE(HandleRequest(context, &connection, c.message));
+    EXPECT_THAT(connection.sent, IsEmpty());
+    EXPECT_THAT(DefaultLines(capture), ElementsAre(c.line));
+  }
+}
+
+TEST(HandleRequest, EveryRequestTypeGetsABinaryReplyRoutedToTheCaller) {
+  for (const char* type : {"CopyDevices", "Mount", "Unmount", "Sync"}) {
+    SCOPED_TRACE(type);
+    log::CaptureSink capture;
+    FakeConnection connection;
+    connection.allowedSPI = AllSPIs();
+    MatchingContext context;
+    ASSERT_TRUE(HandleRequest(context, &connection, Request(plist::Dictionary{{"RequestType", type}})));
+    ASSERT_EQ(connection.sent.size(), 1u);
+    const ipc::Message& reply = connection.sent[0];
+    EXPECT_TRUE(reply.isReply);
+    EXPECT_EQ(reply.replyToken, (plist::Integer{7, false}));
+    const plist::Bytes* bytes = reply.body.find("EncodedDictionary")->data();
+    ASSERT_NE(bytes, nullptr);
+    ASSERT_GE(bytes->size(), 8u);
+    EXPECT_EQ(std::string(bytes->begin(), bytes->begin() + 8), "bplist00");
+    EXPECT_EQ(*plist::ReadBinary(*bytes), plist::Value(plist::Dictionary{{"Status", "Failure"}}));
+    EXPECT_THAT(DefaultLines(capture), IsEmpty());
+  }
+}
+
+TEST(HandleRequest, XmlRequestGetsBinaryReply) {
+  FakeConnection connection;
+  connection.allowedSPI = AllSPIs();
+  MatchingContext context;
+  std::string xml = plist::WriteXml(plist::Dictionary{{"RequestType", "Sync"}});
+  ASSERT_TRUE(HandleRequest(context, &connection,
+                            RequestCarrying(plist::Value(plist::Bytes(xml.begin(), xml.end())))));
+  ASSERT_EQ(connection.sent.size(), 1u);
+  const plist::Bytes& bytes = *connection.sent[0].body.find("EncodedDictionary")->data();
+  EXPECT_TRUE(plist::ReadBinary(bytes).has_value());
+}
+
+TEST(HandleRequest, MissingEntitlementIsLoggedAndRequestStillServed) {
+  struct Case {
+    const char* name;
+    std::optional<plist::Value> allowed;
+    std::vector<std::string> lines;
+  };
+  const std::string listed = std::string(kMissingEntitlement) + "CopyDevices";
+  const Case cases[] = {
+      {"other operation listed", plist::Value(plist::Array{"MountDevice"}),
+       {"Invalid or missing entitlement: CopyDevices", listed}},
+      {"single string instead of array", plist::Value("CopyDevices"),
+       {"Invalid or missing entitlement: com.vantrel.private.brisvale.allowedSPI", listed}},
+      {"absent", std::nullopt,
+       {"Invalid or missing entitlement: com.vantrel.private.brisvale.allowedSPI", listed}},
+      {"non-string elements skipped",
+       plist::Value(plist::Array{plist::Value::Int(1), "CopyDevices"}), {}},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    log::CaptureSink capture;
+    FakeConnection connection;
+    connection.allowedSPI = c.allowed;
+    MatchingContext context;
+    EXPECT_TRUE(HandleRequest(context, &connection,
+                              Request(plist::Dictionary{{"RequestType", "CopyDevices"}})));
+    EXPECT_EQ(connection.sent.size(), 1u);
+    EXPECT_EQ(DefaultLines(capture), c.lines);
+  }
+}
+
+TEST(HandleRequest, RequestWithoutIdGetsReplyWithoutOne) {
+  FakeConnection connection;
+  connection.allowedSPI = AllSPIs();
+  MatchingContext context;
+  ipc::Message message = Request(plist::Dictionary{{"RequestType", "Unmount"}});
+  message.replyToken.reset();
+  ASSERT_TRUE(HandleRequest(context, &connection, message));
+  EXPECT_FALSE(connection.sent.at(0).replyToken.has_value());
+}
+
+TEST(CopyClientName, NamesTheExecutableAndPid) {
+  struct Case {
+    std::string path;
+    std::string name;
+  };
+  const Case cases[] = {
+      {"/usr/libexec/imgclient", "imgclient<412>"},
+      {"imgclient", "imgclient<412>"},
+      {"", "<412>"},
+      {"/usr/bin/", "<412>"},
+      {"/" + std::string(300, 'a'), std::string(255, 'a') + "<412>"},
+  };
+  for (const Case& c : cases) {
+    FakeConnection connection;
+    connection.executablePath = c.path;
+    EXPECT_EQ(CopyClientName(&connection), c.name) << c.path;
+  }
+  log::CaptureSink capture;
+  EXPECT_EQ(CopyClientName(nullptr), std::nullopt);
+  EXPECT_THAT(capture.Texts(), ElementsAre("Invalid input."));
+}
+
+TEST(CheckAllowedSPI, MissingInputs) {
+  log::CaptureSink capture;
+  FakeConnection connection;
+  EXPECT_FALSE(CheckAllowedSPI(nullptr, "CopyDevices"));
+  EXPECT_FALSE(CheckAllowedSPI(&connection, nullptr));
+  EXPECT_THAT(capture.Texts(), ElementsAre("Invalid inputs.", "Invalid inputs."));
+}
+
+}  // namespace
+}  // namespace brisvale
