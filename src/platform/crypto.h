@@ -5,6 +5,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <span>
 
 namespace brisvale::crypto {
@@ -48,6 +49,27 @@ class Hasher {
 };
 
 // --- Signature verification ---------------------------------------------------------
-// (declared by the verification layer that needs them)
+// Each check is true only when the library ran the verification and it reported a
+// valid signature; malformed keys, unsupported sizes and library errors are false.
+
+// Largest RSA modulus the verifiers load: 4096 bits.
+inline constexpr size_t kMaxRsaModulusBytes = 512;
+
+// RSASSA-PKCS1-v1_5 over a digest computed by the caller, with the DigestInfo of
+// `algorithm`. Modulus and exponent are unsigned big-endian integers (leading zero
+// bytes allowed); a modulus above kMaxRsaModulusBytes significant bytes, or an exponent
+// longer than the modulus, is refused. `digest` must be DigestLength(algorithm) bytes.
+bool VerifyRsaPkcs1(std::span<const uint8_t> modulus, std::span<const uint8_t> exponent,
+                    DigestAlgorithm algorithm, std::span<const uint8_t> digest,
+                    std::span<const uint8_t> signature);
+
+// Named prime curves, chosen by the size of an uncompressed X9.63 point (04 || X || Y).
+enum class EcCurve { P256, P384, P521 };
+std::optional<EcCurve> EcCurveForPointSize(size_t pointSize);
+
+// ECDSA over a digest computed by the caller: `point` is an uncompressed X9.63 public
+// key whose size selects the curve; `signature` is the DER ECDSA-Sig-Value.
+bool VerifyEcdsa(std::span<const uint8_t> point, std::span<const uint8_t> digest,
+                 std::span<const uint8_t> signature);
 
 }  // namespace brisvale::crypto
