@@ -49,6 +49,8 @@ class Dictionary {
 
   Dictionary() = default;
   Dictionary(std::initializer_list<Entry> entries);
+  // The entries in their order; none when two of them share a key.
+  static std::optional<Dictionary> FromEntries(std::vector<Entry> entries);
 
   const Value* find(std::string_view key) const;
   void set(std::string key, Value value);
