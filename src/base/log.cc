@@ -226,13 +226,17 @@ bool ParseField(std::string_view format, size_t& i, ArgReader& args, int& field,
   }
   if (i >= format.size() || !IsDigit(format[i])) return true;
   long value = 0;
+  bool inRange = true;
   while (i < format.size() && IsDigit(format[i])) {
     value = value * 10 + (format[i] - '0');
-    if (value > kMaxFieldSize) return false;
+    if (value > kMaxFieldSize) {
+      inRange = false;
+      value = kMaxFieldSize;
+    }
     ++i;
   }
   field = static_cast<int>(value);
-  return true;
+  return inRange;
 }
 
 }  // namespace

@@ -1,0 +1,167 @@
+#include "base/log.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <climits>
+#include <cstdlib>
+#include <thread>
+
+namespace brisvale::log {
+namespace {
+
+using plist::Value;
+
+struct FormatCase {
+  const char* name;
+  std::string format;
+  std::vector<Arg> args;
+  std::string expected;
+};
+
+TEST(LogFormat, Conversions) {
+  const Value text("disk2s1");
+  const Value number = Value::Int(42);
+  const std::optional<Value> missing;
+  const char* nullText = nullptr;
+  const std::string owned = "mnt";  // Args only borrow text, so it must outlive the table
+  const std::vector<FormatCase> cases = {
+      {"literal", "no placeholders", {}, "no placeholders"},
+      {"signed", "%d|%i|%ld|%lld", {-5, 7, -8L, 9LL}, "-5|7|-8|9"},
+      {"status code", "0x%04x", {0xe00002c0 & 0x3FFF}, "0x02c0"},
+      {"status code bare", "%04x", {0x2c0}, "02c0"},
+      {"upper hex and octal", "%X %o %#x", {255, 8, 255}, "FF 10 0xff"},
+      {"int narrows like printf", "%x", {-1}, "ffffffff"},
+      {"long long keeps width", "%llx", {-1LL}, "ffffffffffffffff"},
+      {"char length", "%hhd %hu", {300, 70000}, "44 4464"},
+      {"size_t", "%zu", {SIZE_MAX}, "18446744073709551615"},
+      {"width and alignment", "[%5d][%-5d][%05d]", {42, 42, 42}, "[   42][42   ][00042]"},
+      {"star width", "[%*d][%-*s]", {4, 7, 3, "a"}, "[   7][a  ]"},
+      {"strings", "%s/%s", {"var", owned}, "var/mnt"},
+      {"string width and precision", "[%6s][%.2s]", {"abc", "abcdef"}, "[   abc][ab]"},
+      {"null strings", "%s %s", {nullText, nullptr}, "(null) (null)"},
+      {"char", "%c%c", {'o', 'k'}, "ok"},
+      {"floating", "%.3f %g %e", {1.5, 0.25, 1000.0}, "1.500 0.25 1.000000e+03"},
+      {"percent", "100%% done", {}, "100% done"},
+      {"object string", "mount %@", {text}, "mount disk2s1"},
+      {"object number", "%@", {number}, "42"},
+      {"object pointer", "%@", {&text}, "disk2s1"},
+      {"object missing", "%@ %@", {missing, nullptr}, "(null) (null)"},
+      {"object text", "%@ %@", {"plain", std::string_view("view")}, "plain view"},
+      {"object width", "[%8@]", {text}, "[ disk2s1]"},
+      {"errno", "Failed to open %s : %{errno}d", {"/dev/x", ENOENT}, "Failed to open /dev/x : 2"},
+      {"other annotation ignored", "%{public}s", {"shown"}, "shown"},
+      {"null pointer", "%p", {static_cast<const void*>(nullptr)}, "(nil)"},
+      {"missing argument", "%d and %d", {1}, "1 and <?>"},
+      {"integer for text", "%s", {5}, "<?>"},
+      {"text for integer", "%d", {"5"}, "<?>"},
+      {"integer for floating", "%f", {1}, "<?>"},
+      {"integer for object", "%@", {1}, "<?>"},
+      {"floating for integer", "%x", {1.0}, "<?>"},
+      {"mismatch does not shift", "%d %s %d", {"a", "b", 3}, "<?> b 3"},
+      {"bad star width", "[%*d]", {"w", 5}, "[<?>]"},
+      {"huge width refused", "%99999999d", {1}, "<?>"},
+      {"unknown conversion shown", "%y %n", {1}, "%y %n"},
+      {"cut off at end", "50%", {}, "50%"},
+      {"cut off annotation", "%{errno", {1}, "%{errno"},
+      {"extra arguments ignored", "%d", {1, 2}, "1"},
+  };
+  for (const FormatCase& c : cases) {
+    EXPECT_EQ(Format(c.format, c.args), c.expected) << c.name;
+  }
+}
+
+TEST(LogCapture, RecordsLevelsAndGatesDebug) {
+  CaptureSink capture;
+  Log(Level::Default, "Invalid request type: %@", Value("Bogus"));
+  Log(Level::Info, "info %d", 1);
+  Log(Level::Error, "fatal");
+  Log(Level::Debug, "debug on");
+  SetDebugEnabled(false);
+  Log(Level::Debug, "debug off");
+  Write(Level::Debug, "written directly while off");
+  SetDebugEnabled(true);
+
+  const std::vector<Line> expected = {{Level::Default, "Invalid request type: Bogus"},
+                                      {Level::Info, "info 1"},
+                                      {Level::Error, "fatal"},
+                                      {Level::Debug, "debug on"}};
+  EXPECT_EQ(capture.Lines(), expected);
+  EXPECT_TRUE(capture.Contains(Level::Error, "fatal"));
+  EXPECT_FALSE(capture.Contains(Level::Default, "fatal"));
+  capture.Clear();
+  EXPECT_TRUE(capture.Texts().empty());
+}
+
+TEST(LogCapture, RestoresPreviousSinkAndDebugSetting) {
+  SetDebugEnabled(false);
+  CaptureSink outer;
+  SetDebugEnabled(false);
+  {
+    CaptureSink inner;
+    EXPECT_TRUE(DebugEnabled());
+    Log(Level::Debug, "to inner");
+  }
+  EXPECT_FALSE(DebugEnabled());
+  Log(Level::Default, "to outer");
+  EXPECT_EQ(outer.Texts(), std::vector<std::string>{"to outer"});
+}
+
+TEST(LogCapture, AcceptsLinesFromOtherThreads) {
+  CaptureSink capture;
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 4; ++t) {
+    threads.emplace_back([t] {
+      for (int i = 0; i < 250; ++i) Log(Level::Info, "thread %d line %d", t, i);
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  EXPECT_EQ(capture.Lines().size(), 1000u);
+}
+
+// Runs `body` with stderr redirected into a pipe and returns what it wrote.
+std::string CaptureStderr(const std::function<void()>& body) {
+  int fds[2];
+  EXPECT_EQ(pipe(fds), 0);
+  int saved = dup(STDERR_FILENO);
+  dup2(fds[1], STDERR_FILENO);
+  close(fds[1]);
+  body();
+  dup2(saved, STDERR_FILENO);
+  close(saved);
+  std::string out;
+  char buffer[256];
+  ssize_t n;
+  while ((n = read(fds[0], buffer, sizeof buffer)) > 0) out.append(buffer, n);
+  close(fds[0]);
+  return out;
+}
+
+TEST(LogStderr, PrefixesForJournalAndTerminal) {
+  StderrSink sink;
+  const char* previous = getenv("JOURNAL_STREAM");
+  std::string savedJournal = previous ? previous : "";
+
+  unsetenv("JOURNAL_STREAM");
+  EXPECT_EQ(CaptureStderr([&] {
+              sink.Write(Level::Default, "plain");
+              sink.Write(Level::Error, "bad");
+            }),
+            "default: plain\nerror: bad\n");
+
+  setenv("JOURNAL_STREAM", "8:1234", 1);
+  EXPECT_EQ(CaptureStderr([&] {
+              sink.Write(Level::Default, "a");
+              sink.Write(Level::Debug, "b");
+              sink.Write(Level::Info, "c");
+              sink.Write(Level::Error, "d");
+            }),
+            "<5>a\n<7>b\n<6>c\n<3>d\n");
+
+  if (previous) setenv("JOURNAL_STREAM", savedJournal.c_str(), 1);
+  else unsetenv("JOURNAL_STREAM");
+}
+
+}  // namespace
+}  // namespace brisvale::log

@@ -1,0 +1,182 @@
+#include "base/runloop.h"
+
+#include <gtest/gtest.h>
+#include <sys/epoll.h>
+#include <unistd.h>
+
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace brisvale {
+namespace {
+
+using namespace std::chrono_literals;
+
+struct Pipe {
+  int read = -1, write = -1;
+  Pipe() {
+    int fds[2];
+    EXPECT_EQ(pipe(fds), 0);
+    read = fds[0];
+    write = fds[1];
+  }
+  ~Pipe() {
+    close(read);
+    close(write);
+  }
+  void Fill() { EXPECT_EQ(::write(write, "x", 1), 1); }
+};
+
+TEST(RunLoop, PostedTasksRunInOrderFromAnyThread) {
+  RunLoop loop;
+  std::vector<int> seen;
+  for (int i = 0; i < 100; ++i) loop.Post([&seen, i] { seen.push_back(i); });
+  std::thread poster([&] {
+    for (int i = 100; i < 1100; ++i) loop.Post([&seen, i] { seen.push_back(i); });
+  });
+  EXPECT_TRUE(loop.RunUntil([&] { return seen.size() == 1100; }, 5s));
+  poster.join();
+  for (int i = 0; i < 1100; ++i) ASSERT_EQ(seen[i], i);
+}
+
+TEST(RunLoop, RunUntilChecksAfterEachTaskAndTimesOut) {
+  RunLoop loop;
+  int ran = 0;
+  loop.Post([&] { ++ran; });
+  loop.Post([&] { ++ran; });
+  EXPECT_TRUE(loop.RunUntil([&] { return ran == 1; }, 1s));
+  EXPECT_EQ(ran, 1);  // the second task is still queued
+  EXPECT_EQ(loop.RunOnce(), 1);
+  EXPECT_EQ(ran, 2);
+
+  auto start = RunLoop::Clock::now();
+  EXPECT_FALSE(loop.RunUntil([] { return false; }, 60ms));
+  auto elapsed = RunLoop::Clock::now() - start;
+  EXPECT_GE(elapsed, 60ms);
+  EXPECT_LT(elapsed, 1s);
+}
+
+TEST(RunLoop, FdSourceReportsReadinessUntilRemoved) {
+  RunLoop loop;
+  Pipe pipe;
+  uint32_t events = 0;
+  int calls = 0;
+  SourceHandle source = loop.AddFd(pipe.read, EPOLLIN, [&](uint32_t e) {
+    events = e;
+    ++calls;
+    char c;
+    EXPECT_EQ(read(pipe.read, &c, 1), 1);
+  });
+  ASSERT_TRUE(source);
+  EXPECT_EQ(loop.RunOnce(), 0);
+  pipe.Fill();
+  EXPECT_TRUE(loop.RunUntil([&] { return calls == 1; }, 1s));
+  EXPECT_TRUE(events & EPOLLIN);
+
+  source.Reset();
+  pipe.Fill();
+  loop.RunFor(30ms);
+  EXPECT_EQ(calls, 1);
+}
+
+TEST(RunLoop, SourceRemovedInsideACallbackIsNeverCalledAgain) {
+  RunLoop loop;
+  Pipe a, b, self;
+  a.Fill();
+  b.Fill();
+  self.Fill();
+  // Both are ready in the same batch; whichever runs first removes the other.
+  int calls = 0, selfCalls = 0;
+  SourceHandle first, second, own;
+  first = loop.AddFd(a.read, EPOLLIN, [&](uint32_t) { ++calls; second.Reset(); first.Reset(); });
+  second = loop.AddFd(b.read, EPOLLIN, [&](uint32_t) { ++calls; first.Reset(); second.Reset(); });
+  // Never drained: it stays ready, so only the removal keeps it quiet.
+  own = loop.AddFd(self.read, EPOLLIN, [&](uint32_t) {
+    ++selfCalls;
+    own = SourceHandle();
+  });
+  loop.RunFor(50ms);
+  EXPECT_EQ(calls, 1);
+  EXPECT_EQ(selfCalls, 1);
+}
+
+TEST(RunLoop, TwoSourcesMayWatchOneFd) {
+  RunLoop loop;
+  Pipe pipe;
+  pipe.Fill();
+  int calls = 0;
+  SourceHandle one = loop.AddFd(pipe.read, EPOLLIN, [&](uint32_t) { ++calls; });
+  SourceHandle two = loop.AddFd(pipe.read, EPOLLIN, [&](uint32_t) { ++calls; });
+  ASSERT_TRUE(one && two);
+  EXPECT_EQ(loop.RunOnce(), 2);
+}
+
+TEST(RunLoop, TimersFireInDeadlineOrder) {
+  RunLoop loop;
+  std::string order;
+  SourceHandle c = loop.AddTimer(60ms, [&] { order += 'c'; });
+  SourceHandle a = loop.AddTimer(0ms, [&] { order += 'a'; });
+  SourceHandle b = loop.AddTimer(30ms, [&] { order += 'b'; });
+  SourceHandle cancelled = loop.AddTimer(10ms, [&] { order += 'x'; });
+  cancelled.Reset();
+  EXPECT_TRUE(loop.RunUntil([&] { return order.size() == 3; }, 2s));
+  EXPECT_EQ(order, "abc");
+  loop.RunFor(20ms);
+  EXPECT_EQ(order, "abc");  // one-shot timers do not come back
+}
+
+TEST(RunLoop, RepeatingTimerRepeatsUntilItsHandleGoes) {
+  RunLoop loop;
+  int ticks = 0;
+  SourceHandle timer;
+  timer = loop.AddRepeatingTimer(5ms, [&] {
+    if (++ticks == 4) timer.Reset();
+  });
+  EXPECT_TRUE(loop.RunUntil([&] { return ticks == 4; }, 2s));
+  loop.RunFor(30ms);
+  EXPECT_EQ(ticks, 4);
+}
+
+TEST(RunLoop, StopEndsRunFromAnotherThreadAndBeforeRun) {
+  RunLoop loop;
+  loop.Stop();
+  loop.Run();  // returns at once
+
+  std::thread stopper([&] {
+    std::this_thread::sleep_for(20ms);
+    loop.Stop();
+  });
+  loop.Run();
+  stopper.join();
+
+  int ran = 0;
+  loop.Post([&] { ++ran; loop.Stop(); });
+  loop.Post([&] { ++ran; });
+  loop.Run();
+  EXPECT_EQ(ran, 1);
+}
+
+TEST(BackgroundQueue, RunsTasksByDeadlineAndPostsBack) {
+  RunLoop loop;
+  std::vector<std::string> order;  // touched only on the loop thread
+  auto report = [&](std::string name) {
+    return [&loop, &order, name] { loop.Post([&order, name] { order.push_back(name); }); };
+  };
+  std::optional<BackgroundQueue> queue(std::in_place);
+  queue->PostAfter(60ms, report("late"));
+  queue->PostAfter(20ms, report("soon"));
+  queue->Post(report("now"));
+  queue->Post(report("now too"));
+  queue->PostAfter(10s, report("dropped"));
+  EXPECT_TRUE(loop.RunUntil([&] { return order.size() == 4; }, 2s));
+
+  auto start = std::chrono::steady_clock::now();
+  queue.reset();  // must not wait for the 10-second task
+  EXPECT_LT(std::chrono::steady_clock::now() - start, 1s);
+  loop.RunFor(20ms);
+  EXPECT_EQ(order, (std::vector<std::string>{"now", "now too", "soon", "late"}));
+}
+
+}  // namespace
+}  // namespace brisvale
