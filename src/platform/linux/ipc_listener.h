@@ -1,0 +1,40 @@
+// A listening socket of the Linux transport: accepts connections on the loop and hands
+// each, not yet resumed, to the listener's handler.
+#pragma once
+
+#include <sys/types.h>
+
+#include <memory>
+#include <string>
+
+#include "base/runloop.h"
+#include "platform/ipc_service.h"
+#include "platform/linux/ipc_connection.h"
+#include "platform/linux/ipc_fd.h"
+
+namespace brisvale::ipc {
+
+class LinuxListener : public Listener {
+ public:
+  // `ownedPath`, when not empty, is the socket file this listener bound; it is removed
+  // when the listener goes, unless another socket has replaced it meanwhile.
+  LinuxListener(std::shared_ptr<TransportContext> context, UniqueFd socket, std::string ownedPath);
+  ~LinuxListener() override;
+
+  void Resume(Handler handler) override;
+
+ private:
+  void AcceptReady();
+  void PauseAccepting();
+
+  std::shared_ptr<TransportContext> context_;
+  UniqueFd socket_;
+  std::string ownedPath_;
+  ino_t ownedInode_ = 0;
+  Handler handler_;
+  SourceHandle source_;
+  SourceHandle resumeTimer_;
+  std::shared_ptr<bool> alive_ = std::make_shared<bool>(true);
+};
+
+}  // namespace brisvale::ipc
