@@ -1,0 +1,98 @@
+#include "verify/image_digest.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <memory>
+#include <new>
+
+#include "base/log.h"
+#include "platform/crypto.h"
+
+namespace brisvale::verify {
+namespace {
+
+class FileDescriptor {
+ public:
+  explicit FileDescriptor(int fd) : fd_(fd) {}
+  ~FileDescriptor() {
+    if (fd_ >= 0) close(fd_);
+  }
+  FileDescriptor(const FileDescriptor&) = delete;
+  FileDescriptor& operator=(const FileDescriptor&) = delete;
+  int get() const { return fd_; }
+
+ private:
+  int fd_;
+};
+
+std::optional<plist::Bytes> DigestFile(std::string_view path, crypto::DigestAlgorithm algorithm) {
+  if (path.empty()) {
+    Log(Level::Default, "Invalid input.");
+    return std::nullopt;
+  }
+  std::string pathText(path);
+  FileDescriptor file(open(pathText.c_str(), O_RDONLY | O_CLOEXEC));
+  if (file.get() < 0) {
+    Log(Level::Default, "Failed to create file handle for %@.", pathText);
+    return std::nullopt;
+  }
+  posix_fadvise(file.get(), 0, 0, POSIX_FADV_SEQUENTIAL);
+
+  crypto::Hasher hasher(algorithm);
+  std::unique_ptr<uint8_t[]> buffer(new (std::nothrow) uint8_t[kDigestReadSize]);
+  if (!buffer) {
+    Log(Level::Default, "Failed to allocate memory: %{errno}d", ENOMEM);
+    return std::nullopt;
+  }
+  for (;;) {
+    ssize_t count = read(file.get(), buffer.get(), kDigestReadSize);
+    if (count < 0 && errno == EINTR) continue;
+    if (count < 0) {
+      Log(Level::Default, "Failed to read %@: %{errno}d", pathText, errno);
+      return std::nullopt;
+    }
+    if (count == 0) break;
+    if (!hasher.Update({buffer.get(), static_cast<size_t>(count)})) break;
+  }
+  plist::Bytes digest(crypto::DigestLength(algorithm));
+  if (!hasher.Finish(digest)) {
+    Log(Level::Default, "Failed to compute the digest of %@.", pathText);
+    return std::nullopt;
+  }
+  return digest;
+}
+
+}  // namespace
+
+std::optional<plist::Bytes> DigestFileSha1(std::string_view path) {
+  return DigestFile(path, crypto::DigestAlgorithm::Sha1);
+}
+
+std::optional<plist::Bytes> DigestFileSha384(std::string_view path) {
+  return DigestFile(path, crypto::DigestAlgorithm::Sha384);
+}
+
+int DigestImageFile(std::string_view path, std::vector<uint8_t>* digest, long length) {
+  if (!digest) {
+    Log(Level::Default, "Invalid input");
+    return -1;
+  }
+  std::optional<plist::Bytes> computed;
+  if (length == static_cast<long>(crypto::kSha384Length)) {
+    computed = DigestFileSha384(path);
+  } else if (length == static_cast<long>(crypto::kSha1Length)) {
+    computed = DigestFileSha1(path);
+  } else {
+    Log(Level::Default, "Unsupported digest size: %ld", length);
+  }
+  if (!computed) {
+    Log(Level::Default, "Failed to digest data.");
+    return -1;
+  }
+  *digest = std::move(*computed);
+  return 0;
+}
+
+}  // namespace brisvale::verify
