@@ -302,13 +302,13 @@ std::string FormatIsoDate(Date date) {
   } else {
     whole = static_cast<int64_t>(seconds);
   }
-  int64_t unix = whole + kReferenceUnixSeconds;
-  int64_t days = unix >= 0 ? unix / 86400 : -((-unix + 86399) / 86400);
-  int64_t secondOfDay = unix - days * 86400;
+  int64_t unixSeconds = whole + kReferenceUnixSeconds;
+  int64_t days = unixSeconds >= 0 ? unixSeconds / 86400 : -((-unixSeconds + 86399) / 86400);
+  int64_t secondOfDay = unixSeconds - days * 86400;
   int64_t year;
   unsigned month, day;
   CivilFromDays(days, year, month, day);
-  char buffer[32];
+  char buffer[96];
   std::snprintf(buffer, sizeof buffer, "%04lld-%02u-%02uT%02d:%02d:%02dZ",
                 static_cast<long long>(year), month, day, static_cast<int>(secondOfDay / 3600),
                 static_cast<int>(secondOfDay / 60 % 60), static_cast<int>(secondOfDay % 60));
@@ -336,8 +336,8 @@ std::optional<Date> ParseIsoDate(std::string_view text) {
       *hour > 23 || *minute > 59 || *second > 59) {
     return std::nullopt;
   }
-  int64_t unix = DaysFromCivil(*year, *month, *day) * 86400 + *hour * 3600 + *minute * 60 + *second;
-  return Date{static_cast<double>(unix - kReferenceUnixSeconds)};
+  int64_t unixSeconds = DaysFromCivil(*year, *month, *day) * 86400 + *hour * 3600 + *minute * 60 + *second;
+  return Date{static_cast<double>(unixSeconds - kReferenceUnixSeconds)};
 }
 
 std::optional<char32_t> DecodeUtf8(std::string_view text, size_t& pos) {

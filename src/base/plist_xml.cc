@@ -61,9 +61,9 @@ std::optional<double> ParseReal(std::string_view text) {
   if (!text.empty() && text.front() == '+') text.remove_prefix(1);
   double value = 0;
   auto [end, status] = std::from_chars(text.data(), text.data() + text.size(), value);
-  // Out-of-range magnitudes read as their nearest infinity or zero.
-  if (text.empty() || end != text.data() + text.size() ||
-      (status != std::errc() && status != std::errc::result_out_of_range)) {
+  // Magnitudes beyond a double (1e999) are refused: no writer produces them, and
+  // reading them as 0 would be silently wrong.
+  if (text.empty() || end != text.data() + text.size() || status != std::errc()) {
     return std::nullopt;
   }
   return value;
@@ -232,7 +232,7 @@ class XmlReader {
         return;
       }
       std::optional<Value> value = LeafValue(element);
-      if (!value) return Stop("malformed value");
+      if (!value) return Stop(MalformedText(element));
       return Deliver(std::move(*value));
     }
     Frame frame = std::move(stack_.back());
@@ -250,6 +250,16 @@ class XmlReader {
         if (!dictionary) return Stop("duplicate dictionary key");
         return Deliver(Value(std::move(*dictionary)));
       }
+    }
+  }
+
+  static const char* MalformedText(Element element) {
+    switch (element) {
+      case Element::Integer: return "malformed integer";
+      case Element::Real: return "malformed real";
+      case Element::Date: return "malformed date";
+      case Element::Data: return "malformed base64 data";
+      default: return "malformed value";
     }
   }
 
