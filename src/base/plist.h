@@ -56,10 +56,11 @@ class Dictionary {
   void set(std::string key, Value value);
   bool erase(std::string_view key);
 
-  size_t size() const { return entries_.size(); }
-  bool empty() const { return entries_.empty(); }
-  auto begin() const { return entries_.begin(); }
-  auto end() const { return entries_.end(); }
+  // Defined below Value: clang needs Value complete to instantiate these.
+  size_t size() const;
+  bool empty() const;
+  std::vector<Entry>::const_iterator begin() const;
+  std::vector<Entry>::const_iterator end() const;
 
   bool operator==(const Dictionary& other) const;
 
@@ -121,6 +122,15 @@ class Value {
   explicit Value(Storage storage) : storage_(std::move(storage)) {}
   Storage storage_;
 };
+
+inline size_t Dictionary::size() const { return entries_.size(); }
+inline bool Dictionary::empty() const { return entries_.empty(); }
+inline std::vector<Dictionary::Entry>::const_iterator Dictionary::begin() const {
+  return entries_.begin();
+}
+inline std::vector<Dictionary::Entry>::const_iterator Dictionary::end() const {
+  return entries_.end();
+}
 
 // "%@" of a missing value.
 std::string Describe(const Value* value);
