@@ -1,0 +1,119 @@
+#include "platform/linux/registry_probe.h"
+
+#include <blkid/blkid.h>
+#include <fcntl.h>
+#include <linux/loop.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <unistd.h>
+
+#include <cctype>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <memory>
+
+#include "base/log.h"
+
+namespace brisvale::registry::sysfs {
+namespace {
+
+struct ProbeDeleter {
+  void operator()(blkid_probe probe) const { blkid_free_probe(probe); }
+};
+
+class Fd {
+ public:
+  explicit Fd(int fd) : fd_(fd) {}
+  ~Fd() {
+    if (fd_ >= 0) close(fd_);
+  }
+  Fd(const Fd&) = delete;
+  Fd& operator=(const Fd&) = delete;
+  int get() const { return fd_; }
+
+ private:
+  int fd_;
+};
+
+}  // namespace
+
+std::string SchemeContent(const std::string& blkidTableType) {
+  if (blkidTableType == "gpt") return "GPT_partition_scheme";
+  if (blkidTableType == "dos") return "MBR_partition_scheme";
+  if (blkidTableType.empty()) return "";
+  return blkidTableType + "_partition_scheme";
+}
+
+std::string PartitionContent(const char* gptTypeGuid, int mbrType) {
+  if (gptTypeGuid && *gptTypeGuid) {
+    std::string guid(gptTypeGuid);
+    for (char& c : guid) c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
+    return guid;
+  }
+  char text[8];
+  std::snprintf(text, sizeof text, "0x%02X", mbrType & 0xff);
+  return text;
+}
+
+std::optional<PartitionTable> ProbePartitionTable(const std::string& node) {
+  std::unique_ptr<blkid_struct_probe, ProbeDeleter> probe(
+      blkid_new_probe_from_filename(node.c_str()));
+  if (!probe) return std::nullopt;
+  PartitionTable table;
+  blkid_partlist partitions = blkid_probe_get_partitions(probe.get());
+  if (!partitions) return table;  // no partition table (or none libblkid knows)
+  if (blkid_parttable root = blkid_partlist_get_table(partitions)) {
+    const char* type = blkid_parttable_get_type(root);
+    table.scheme = SchemeContent(type ? type : "");
+  }
+  int count = blkid_partlist_numof_partitions(partitions);
+  for (int i = 0; i < count; ++i) {
+    blkid_partition partition = blkid_partlist_get_partition(partitions, i);
+    if (!partition) continue;
+    table.contentByNumber[blkid_partition_get_partno(partition)] = PartitionContent(
+        blkid_partition_get_type_string(partition), blkid_partition_get_type(partition));
+  }
+  return table;
+}
+
+bool IsUuidText(std::string_view text) {
+  if (text.size() != 36) return false;
+  for (size_t i = 0; i < text.size(); ++i) {
+    bool dash = i == 8 || i == 13 || i == 18 || i == 23;
+    if (dash ? text[i] != '-' : !std::isxdigit(static_cast<unsigned char>(text[i]))) {
+      return false;
+    }
+  }
+  return true;
+}
+
+std::optional<std::string> ReadLoopIdentifier(const std::string& node) {
+  Fd fd(open(node.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  if (fd.get() < 0) return std::nullopt;
+  loop_info64 info{};
+  if (ioctl(fd.get(), LOOP_GET_STATUS64, &info) != 0) return std::nullopt;
+  const char* name = reinterpret_cast<const char*>(info.lo_file_name);
+  std::string text(name, strnlen(name, sizeof info.lo_file_name));
+  if (!IsUuidText(text)) return std::nullopt;
+  return text;
+}
+
+bool EnsureBlockNode(const std::string& path, dev_t number) {
+  struct stat existing;
+  if (lstat(path.c_str(), &existing) == 0 || errno != ENOENT) return false;
+  if (mknod(path.c_str(), S_IFBLK | 0660, number) != 0) {
+    Log(Level::Default, "Failed to create device node %s: %{errno}d", path, errno);
+    return false;
+  }
+  return true;
+}
+
+void RemoveBlockNode(const std::string& path, dev_t number) {
+  struct stat existing;
+  if (lstat(path.c_str(), &existing) != 0) return;
+  if (S_ISBLK(existing.st_mode) && existing.st_rdev == number) unlink(path.c_str());
+}
+
+}  // namespace brisvale::registry::sysfs
