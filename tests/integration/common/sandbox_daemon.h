@@ -1,0 +1,72 @@
+// The real daemon in a throw-away sandbox root, for integration tests: started in the
+// constructor (or on demand), stopped, and the sandbox torn down, in the destructor,
+// also when a test fails half-way.
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "base/plist.h"
+#include "platform/linux/ipc_client.h"
+
+namespace brisvale::testing {
+
+// Skips the current test unless running as root.
+#define BRISVALE_REQUIRE_ROOT()                                             \
+  do {                                                                      \
+    if (geteuid() != 0) {                                                   \
+      GTEST_SKIP() << "needs root: mounts, loop devices, chroot";           \
+    }                                                                       \
+  } while (0)
+
+class SandboxDaemon {
+ public:
+  // Makes an empty sandbox directory; Start() runs the daemon in it.
+  SandboxDaemon();
+  ~SandboxDaemon();
+  SandboxDaemon(const SandboxDaemon&) = delete;
+  SandboxDaemon& operator=(const SandboxDaemon&) = delete;
+
+  // Starts the daemon with --root, --verbose and `extraArguments`; waits until it
+  // listens. `listenFd`, when given, is passed by socket activation as descriptor 3.
+  bool Start(const std::vector<std::string>& extraArguments = {}, int listenFd = -1);
+  // Ends the daemon (SIGTERM, then SIGKILL) and waits for it; the sandbox stays.
+  void Stop();
+  bool Running() const { return pid_ > 0; }
+  pid_t pid() const { return pid_; }
+
+  const std::string& root() const { return root_; }
+  // A path inside the sandbox, as seen from outside ("/private/var" -> root + that).
+  std::string Path(const std::string& inside) const { return root_ + inside; }
+  std::string ServiceSocket() const;
+  std::string EventsSocket() const;
+
+  // One request {"EncodedDictionary": bytes}; the reply's decoded dictionary when Ok.
+  ipc::ClientReply SendEncoded(const plist::Bytes& encoded,
+                               std::optional<plist::Value>* decodedReply = nullptr);
+  ipc::ClientReply SendRequest(const plist::Value& request,
+                               std::optional<plist::Value>* decodedReply = nullptr);
+  ipc::ClientReply PostHardwareEvent(const std::string& name);
+
+  // The daemon's log so far, one line a string ("level: text").
+  std::vector<std::string> LogLines() const;
+  bool LogContains(const std::string& line) const;
+  // Waits up to `timeout` for `line` to appear in the log.
+  bool WaitForLogLine(const std::string& line,
+                      std::chrono::milliseconds timeout = std::chrono::seconds(5)) const;
+
+ private:
+  std::string root_;
+  std::string logPath_;
+  pid_t pid_ = -1;
+};
+
+// Runs a program, waits for it, returns its exit status (-1 if it did not exit) and
+// what it printed on stdout.
+int RunProgram(const std::vector<std::string>& argv, std::string* output = nullptr);
+
+}  // namespace brisvale::testing
