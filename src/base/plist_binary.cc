@@ -1,6 +1,7 @@
 // Binary property lists: "bplist00", a header, the objects, a table of object offsets
 // and a 32-byte trailer. Objects refer to each other by index into the offset table.
 #include <bit>
+#include <cmath>
 #include <cstring>
 #include <limits>
 #include <string_view>
@@ -187,8 +188,11 @@ class BinaryReader {
       case kDate & 0xF0:
         if (marker != kDate) return Fail("bad date");
         if (!Fits(cursor, 8, 1)) return Fail("truncated date");
-        out = Value(Date{std::bit_cast<double>(Number(cursor, 8))});
-        return true;
+        if (double seconds = std::bit_cast<double>(Number(cursor, 8)); std::isfinite(seconds)) {
+          out = Value(Date{seconds});
+          return true;
+        }
+        return Fail("date is not a number");
       case kData: {
         uint64_t length;
         if (!ReadCount(cursor, nibble, length)) return false;

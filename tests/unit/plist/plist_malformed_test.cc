@@ -77,6 +77,7 @@ TEST(PlistMalformed, BinaryStructureIsChecked) {
       {"key that is not a string", Assemble({Container(0xD0, {1, 1}), {0x10, 1}})},
       {"duplicate key", Assemble({Container(0xD0, {1, 1, 2, 2}), ascii, ascii})},
       {"32-byte integer", Assemble({{0x15}})},
+      {"date that is not a number", Assemble({{0x33, 0xFF, 0xF8, 0, 0, 0, 0, 0, 0}})},
       {"128-bit integer beyond 64 bits", Assemble({{0x14, 0, 0, 0, 0, 0, 0, 0, 1, 0, 0, 0, 0,
                                                     0, 0, 0, 0}})},
       {"null object", Assemble({{0x00}})},
