@@ -15,10 +15,11 @@ work=$(mktemp -d)
 trap 'rm -rf "$work"' EXIT
 
 # The manifest-constraint extension: a private OID with 10 content bytes
-# (2B 06 01 04 01 83 BF 30 01 01), whose value is a SET holding one [PRIVATE "MANP"]
-# constraint group that pins "SDOM" to INTEGER 1.
+# (2B 06 01 04 01 83 BF 30 01 01), whose value is a SET holding one empty [PRIVATE "MANP"]
+# constraint group: the leaf pins nothing, and the signing tool mints leaves that pin
+# values when asked to.
 constraint_oid=1.3.6.1.4.1.57264.1.1
-constraint_value=3123ff84ea859c501c301a16044d414e503112ff859a919e4d0b3009160453444f4d020101
+constraint_value=3111ff84ea859c500a300816044d414e503100
 expected_name="Brisvale Development Manifest Issuing CA1"
 
 cat >"$work/openssl.cnf" <<CNF

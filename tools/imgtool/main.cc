@@ -30,7 +30,12 @@ constexpr const char* kUsage = R"(usage: brisvale-imgtool COMMAND [OPTIONS]
       --object-property TAG=TYPE:VALUE   extra object property (repeatable)
                              TYPE is int, bool, hex or str
       --object CODE          object code (default pdmg)
-      --constrained-leaf     sign with the leaf that carries the constraint extension
+      --leaf constrained|plain
+                             the leaf with the manifest-constraint extension (default;
+                             it pins nothing) or the one without any
+      --leaf-constraint TAG=TYPE:VALUE
+                             sign with a fresh leaf whose extension pins this manifest
+                             property (repeatable)
 
   identity -o FILE [--nonce HEX] [--board N] [--chip N] [--ecid N]
            [--production BOOL] [--security BOOL] [--hash-method TEXT]

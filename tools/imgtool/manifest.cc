@@ -40,8 +40,8 @@ int BuildManifest(const std::vector<std::string>& args) {
   Options options(args,
                   {"--pki", "--image", "--sub-type", "--chain", "--dgst", "--nonce", "--board",
                    "--chip", "--ecid", "--production", "--security", "--sdom", "--ekey",
-                   "--object", "--output"},
-                  {"--property", "--object-property"}, {"--constrained-leaf"});
+                   "--object", "--leaf", "--output"},
+                  {"--property", "--object-property", "--leaf-constraint"});
   std::string pki = options.Get("--pki").value_or(BRISVALE_DEV_PKI_DIR);
   std::string output = options.Require("--output");
 
@@ -101,15 +101,32 @@ int BuildManifest(const std::vector<std::string>& args) {
   }
 
   // The SHA-1 chain is intermediate then leaf under the general root; the SHA-384 chain
-  // is one leaf under the secure-boot root.
-  std::string leaf = chain == "sha1" ? "general-leaf" : "secure-leaf";
-  std::string leafCertificate = leaf + (options.Has("--constrained-leaf") ? "-constrained" : "");
+  // is one leaf under the secure-boot root. The leaf carries the constraint extension
+  // (empty unless constraints are asked for), or none with --leaf plain.
+  std::string issuer = chain == "sha1" ? pki + "/general-intermediate" : pki + "/secure-root";
+  std::string leaf = chain == "sha1" ? pki + "/general-leaf" : pki + "/secure-leaf";
+  std::string leafKind = options.Get("--leaf").value_or("constrained");
+  if (leafKind != "constrained" && leafKind != "plain") {
+    throw ToolError("--leaf is constrained or plain", true);
+  }
   std::vector<dw::Bytes> certificates;
   if (chain == "sha1") certificates.push_back(ReadFile(pki + "/general-intermediate.der"));
-  certificates.push_back(ReadFile(pki + "/" + leafCertificate + ".der"));
+  std::vector<std::string> constraints = options.All("--leaf-constraint");
+  if (!constraints.empty()) {
+    if (leafKind == "plain") throw ToolError("--leaf-constraint needs the constrained leaf", true);
+    std::vector<dw::Bytes> pinned;
+    for (const std::string& spec : constraints) {
+      pinned.push_back(TypedProperty(spec, "--leaf-constraint"));
+    }
+    certificates.push_back(MintLeafCertificate(
+        issuer + ".key", issuer + ".der", leaf + ".key", bodyDigest,
+        ReadFile(pki + "/manifest-constraint-oid.bin"), dw::Set({dw::Dictionary("MANP", pinned)})));
+  } else {
+    certificates.push_back(ReadFile(leaf + (leafKind == "plain" ? ".der" : "-constrained.der")));
+  }
 
   dw::Bytes body = dw::ManifestBody(manifestProperties, {object});
-  Bytes signature = SignDigest(pki + "/" + leaf + ".key", bodyDigest,
+  Bytes signature = SignDigest(leaf + ".key", bodyDigest,
                                DigestOfBytes(body, bodyDigest));
   WriteFile(output, dw::Manifest(body, signature, certificates));
   return 0;

@@ -2,6 +2,7 @@
 
 #include <openssl/pem.h>
 #include <openssl/rsa.h>
+#include <openssl/x509.h>
 
 #include <cstdio>
 #include <fstream>
@@ -15,6 +16,16 @@ struct Deleter {
   template <typename T>
   void operator()(T* object) const { Free(object); }
 };
+
+using PkeyPtr = std::unique_ptr<EVP_PKEY, Deleter<EVP_PKEY_free>>;
+
+PkeyPtr LoadPrivateKey(const std::string& keyPath) {
+  std::unique_ptr<FILE, Deleter<fclose>> file(std::fopen(keyPath.c_str(), "rb"));
+  if (!file) throw ToolError("cannot open key " + keyPath);
+  PkeyPtr key(PEM_read_PrivateKey(file.get(), nullptr, nullptr, nullptr));
+  if (!key) throw ToolError("not a PEM private key: " + keyPath);
+  return key;
+}
 
 }  // namespace
 
@@ -53,11 +64,7 @@ Bytes DigestOfBytes(const Bytes& bytes, const EVP_MD* md) {
 }
 
 Bytes SignDigest(const std::string& keyPath, const EVP_MD* md, const Bytes& digest) {
-  std::unique_ptr<FILE, Deleter<fclose>> file(std::fopen(keyPath.c_str(), "rb"));
-  if (!file) throw ToolError("cannot open key " + keyPath);
-  std::unique_ptr<EVP_PKEY, Deleter<EVP_PKEY_free>> key(
-      PEM_read_PrivateKey(file.get(), nullptr, nullptr, nullptr));
-  if (!key) throw ToolError("not a PEM private key: " + keyPath);
+  PkeyPtr key = LoadPrivateKey(keyPath);
   std::unique_ptr<EVP_PKEY_CTX, Deleter<EVP_PKEY_CTX_free>> ctx(
       EVP_PKEY_CTX_new(key.get(), nullptr));
   if (!ctx || EVP_PKEY_sign_init(ctx.get()) != 1 ||
@@ -78,6 +85,52 @@ Bytes SignDigest(const std::string& keyPath, const EVP_MD* md, const Bytes& dige
   }
   signature.resize(length);
   return signature;
+}
+
+Bytes MintLeafCertificate(const std::string& issuerKey, const std::string& issuerCertificate,
+                          const std::string& leafKey, const EVP_MD* md, const Bytes& oidContent,
+                          const Bytes& extensionValue) {
+  PkeyPtr signer = LoadPrivateKey(issuerKey);
+  PkeyPtr subjectKey = LoadPrivateKey(leafKey);
+  Bytes issuerDer = ReadFile(issuerCertificate);
+  const unsigned char* cursor = issuerDer.data();
+  std::unique_ptr<X509, Deleter<X509_free>> issuer(
+      d2i_X509(nullptr, &cursor, static_cast<long>(issuerDer.size())));
+  if (!issuer) throw ToolError("not a DER certificate: " + issuerCertificate);
+
+  Bytes oidDer{0x06, static_cast<uint8_t>(oidContent.size())};
+  oidDer.insert(oidDer.end(), oidContent.begin(), oidContent.end());
+  cursor = oidDer.data();
+  std::unique_ptr<ASN1_OBJECT, Deleter<ASN1_OBJECT_free>> oid(
+      d2i_ASN1_OBJECT(nullptr, &cursor, static_cast<long>(oidDer.size())));
+  std::unique_ptr<ASN1_OCTET_STRING, Deleter<ASN1_OCTET_STRING_free>> value(
+      ASN1_OCTET_STRING_new());
+  std::unique_ptr<X509, Deleter<X509_free>> leaf(X509_new());
+  const unsigned char commonName[] = "Brisvale Development Pinned Signer";
+  bool built =
+      oidContent.size() < 128 && oid && value && leaf &&
+      ASN1_OCTET_STRING_set(value.get(), extensionValue.data(),
+                            static_cast<int>(extensionValue.size())) == 1 &&
+      X509_set_version(leaf.get(), X509_VERSION_3) == 1 &&
+      ASN1_INTEGER_set(X509_get_serialNumber(leaf.get()), 0x5151) == 1 &&
+      X509_set_issuer_name(leaf.get(), X509_get_subject_name(issuer.get())) == 1 &&
+      X509_NAME_add_entry_by_txt(X509_get_subject_name(leaf.get()), "CN", V_ASN1_PRINTABLESTRING,
+                                 commonName, -1, -1, 0) == 1 &&
+      ASN1_TIME_set_string(X509_getm_notBefore(leaf.get()), "20100101000000Z") == 1 &&
+      ASN1_TIME_set_string(X509_getm_notAfter(leaf.get()), "20400101000000Z") == 1 &&
+      X509_set_pubkey(leaf.get(), subjectKey.get()) == 1;
+  if (built) {
+    std::unique_ptr<X509_EXTENSION, Deleter<X509_EXTENSION_free>> extension(
+        X509_EXTENSION_create_by_OBJ(nullptr, oid.get(), 0, value.get()));
+    built = extension && X509_add_ext(leaf.get(), extension.get(), -1) == 1 &&
+            X509_sign(leaf.get(), signer.get(), md) > 0;
+  }
+  unsigned char* der = nullptr;
+  int length = built ? i2d_X509(leaf.get(), &der) : -1;
+  if (length <= 0) throw ToolError("cannot build the leaf certificate");
+  Bytes bytes(der, der + length);
+  OPENSSL_free(der);
+  return bytes;
 }
 
 }  // namespace brisvale::imgtool

@@ -16,3 +16,14 @@ Bytes DigestOfBytes(const Bytes& bytes, const EVP_MD* md);
 Bytes SignDigest(const std::string& keyPath, const EVP_MD* md, const Bytes& digest);
 
 }  // namespace brisvale::imgtool
+
+namespace brisvale::imgtool {
+
+// A leaf certificate for the public key of `leafKey`, issued by the certificate
+// `issuerCertificate` (DER file) with `issuerKey` and `md`, carrying an extension with
+// OID content `oidContent` and value `extensionValue`. Valid 2010-2040.
+Bytes MintLeafCertificate(const std::string& issuerKey, const std::string& issuerCertificate,
+                          const std::string& leafKey, const EVP_MD* md, const Bytes& oidContent,
+                          const Bytes& extensionValue);
+
+}  // namespace brisvale::imgtool
