@@ -1,0 +1,208 @@
+#include "test_support.h"
+
+#include <openssl/pem.h>
+#include <openssl/rsa.h>
+#include <openssl/x509.h>
+#include <openssl/x509v3.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <algorithm>
+#include <fstream>
+#include <iterator>
+#include <memory>
+#include <stdexcept>
+
+#include "derwriter/der_writer.h"
+
+namespace brisvale::testing {
+namespace {
+
+template <auto Free>
+struct Deleter {
+  template <typename T>
+  void operator()(T* object) const { Free(object); }
+};
+using PkeyPtr = std::unique_ptr<EVP_PKEY, Deleter<EVP_PKEY_free>>;
+using X509Ptr = std::unique_ptr<X509, Deleter<X509_free>>;
+
+PkeyPtr LoadKey(const std::string& path) {
+  std::unique_ptr<FILE, Deleter<fclose>> file(std::fopen(path.c_str(), "rb"));
+  if (!file) throw std::runtime_error("cannot open " + path);
+  PkeyPtr key(PEM_read_PrivateKey(file.get(), nullptr, nullptr, nullptr));
+  if (!key) throw std::runtime_error("bad key " + path);
+  return key;
+}
+
+X509Ptr LoadDer(const std::string& path) {
+  Bytes der = ReadBytes(path);
+  const unsigned char* cursor = der.data();
+  X509Ptr certificate(d2i_X509(nullptr, &cursor, static_cast<long>(der.size())));
+  if (!certificate) throw std::runtime_error("bad certificate " + path);
+  return certificate;
+}
+
+void Check(bool ok, const char* what) {
+  if (!ok) throw std::runtime_error(what);
+}
+
+}  // namespace
+
+std::string Pki(const std::string& name) { return std::string(BRISVALE_PKI_DIR) + "/" + name; }
+
+Bytes ReadBytes(const std::filesystem::path& path) {
+  std::ifstream file(path, std::ios::binary);
+  if (!file) throw std::runtime_error("cannot read " + path.string());
+  return Bytes((std::istreambuf_iterator<char>(file)), std::istreambuf_iterator<char>());
+}
+
+void WriteBytes(const std::filesystem::path& path, const Bytes& bytes) {
+  std::ofstream file(path, std::ios::binary | std::ios::trunc);
+  file.write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
+  if (!file.flush()) throw std::runtime_error("cannot write " + path.string());
+}
+
+ScratchDir::ScratchDir() {
+  std::string pattern = (std::filesystem::temp_directory_path() / "brisvale-verify-XXXXXX").string();
+  if (!mkdtemp(pattern.data())) throw std::runtime_error("mkdtemp failed");
+  path_ = pattern;
+}
+
+ScratchDir::~ScratchDir() {
+  std::error_code ignored;
+  std::filesystem::remove_all(path_, ignored);
+}
+
+bool RunImgtool(const std::vector<std::string>& args) {
+  std::vector<char*> argv{const_cast<char*>(BRISVALE_IMGTOOL)};
+  for (const std::string& arg : args) argv.push_back(const_cast<char*>(arg.c_str()));
+  argv.push_back(nullptr);
+  pid_t child = fork();
+  if (child == 0) {
+    execv(argv[0], argv.data());
+    _exit(127);
+  }
+  int status = 0;
+  if (child < 0 || waitpid(child, &status, 0) != child) return false;
+  return WIFEXITED(status) && WEXITSTATUS(status) == 0;
+}
+
+Bytes MintCertificate(const CertificateRecipe& recipe) {
+  PkeyPtr issuerKey = LoadKey(recipe.issuerKey);
+  PkeyPtr subjectKey = LoadKey(recipe.subjectKey);
+  X509Ptr issuer = LoadDer(recipe.issuerCertificate);
+  X509Ptr certificate(X509_new());
+  Check(certificate && X509_set_version(certificate.get(), X509_VERSION_3), "version");
+  ASN1_INTEGER_set(X509_get_serialNumber(certificate.get()), 4242);
+  Check(X509_set_issuer_name(certificate.get(), X509_get_subject_name(issuer.get())), "issuer");
+  X509_NAME* subject = X509_get_subject_name(certificate.get());
+  Check(X509_NAME_add_entry_by_txt(subject, "CN", V_ASN1_PRINTABLESTRING,
+                                   reinterpret_cast<const unsigned char*>(recipe.commonName.c_str()),
+                                   -1, -1, 0),
+        "subject");
+  Check(ASN1_TIME_set_string(X509_getm_notBefore(certificate.get()), recipe.notBefore.c_str()) &&
+            ASN1_TIME_set_string(X509_getm_notAfter(certificate.get()), recipe.notAfter.c_str()),
+        "validity");
+  Check(X509_set_pubkey(certificate.get(), subjectKey.get()), "key");
+  if (recipe.paddingExtensionSize > 0) {
+    std::unique_ptr<ASN1_OBJECT, Deleter<ASN1_OBJECT_free>> oid(
+        OBJ_txt2obj("1.3.6.1.4.1.57264.9.9", 1));
+    std::unique_ptr<ASN1_OCTET_STRING, Deleter<ASN1_OCTET_STRING_free>> value(
+        ASN1_OCTET_STRING_new());
+    Bytes filler(recipe.paddingExtensionSize, 0x5A);
+    Check(oid && value &&
+              ASN1_OCTET_STRING_set(value.get(), filler.data(), static_cast<int>(filler.size())),
+          "filler");
+    std::unique_ptr<X509_EXTENSION, Deleter<X509_EXTENSION_free>> extension(
+        X509_EXTENSION_create_by_OBJ(nullptr, oid.get(), 0, value.get()));
+    Check(extension && X509_add_ext(certificate.get(), extension.get(), -1), "extension");
+  }
+  Check(X509_sign(certificate.get(), issuerKey.get(), recipe.digest) > 0, "sign");
+  unsigned char* der = nullptr;
+  int length = i2d_X509(certificate.get(), &der);
+  Check(length > 0, "encode");
+  Bytes bytes(der, der + length);
+  OPENSSL_free(der);
+  return bytes;
+}
+
+Bytes ToBeSigned(const Bytes& certificate) {
+  // SEQUENCE { tbs SEQUENCE, ... }: skip the outer header, then take one element.
+  auto elementSize = [&](size_t offset) {
+    size_t lengthByte = certificate.at(offset + 1);
+    if (lengthByte < 0x80) return 2 + lengthByte;
+    size_t octets = lengthByte & 0x7F, length = 0;
+    for (size_t i = 0; i < octets; ++i) length = length * 256 + certificate.at(offset + 2 + i);
+    return 2 + octets + length;
+  };
+  size_t lengthByte = certificate.at(1);
+  size_t start = lengthByte < 0x80 ? 2 : 2 + (lengthByte & 0x7F);
+  size_t size = elementSize(start);
+  return Bytes(certificate.begin() + static_cast<long>(start),
+               certificate.begin() + static_cast<long>(start + size));
+}
+
+Bytes Resign(const Bytes& toBeSigned, const std::string& issuerKey, const EVP_MD* digest) {
+  namespace dw = derwriter;
+  Bytes hash(static_cast<size_t>(EVP_MD_get_size(digest)));
+  Check(EVP_Digest(toBeSigned.data(), toBeSigned.size(), hash.data(), nullptr, digest, nullptr),
+        "digest");
+  Bytes signature = SignDigestWith(issuerKey, digest, hash);
+  const char* algorithm = EVP_MD_get_type(digest) == NID_sha1     ? "1.2.840.113549.1.1.5"
+                          : EVP_MD_get_type(digest) == NID_sha256 ? "1.2.840.113549.1.1.11"
+                                                                  : "1.2.840.113549.1.1.12";
+  return dw::Sequence({toBeSigned, dw::Sequence({dw::Oid(algorithm), dw::Null()}),
+                       dw::BitString(signature)});
+}
+
+Bytes FromHex(const std::string& hex) {
+  Bytes bytes;
+  for (size_t i = 0; i + 1 < hex.size(); i += 2) {
+    bytes.push_back(static_cast<uint8_t>(std::stoi(hex.substr(i, 2), nullptr, 16)));
+  }
+  return bytes;
+}
+
+Bytes ReplaceOnce(const Bytes& bytes, const std::string& fromHex, const std::string& toHex) {
+  Bytes from = FromHex(fromHex), to = FromHex(toHex);
+  auto found = std::search(bytes.begin(), bytes.end(), from.begin(), from.end());
+  if (found == bytes.end() || from.size() != to.size() ||
+      std::search(found + 1, bytes.end(), from.begin(), from.end()) != bytes.end()) {
+    throw std::runtime_error("pattern not found exactly once: " + fromHex);
+  }
+  Bytes result = bytes;
+  std::copy(to.begin(), to.end(), result.begin() + (found - bytes.begin()));
+  return result;
+}
+
+Bytes RsaPublicKeyOf(const std::string& keyPath) {
+  PkeyPtr key = LoadKey(keyPath);
+  unsigned char* der = nullptr;
+  int length = i2d_PublicKey(key.get(), &der);
+  Check(length > 0, "public key");
+  Bytes bytes(der, der + length);
+  OPENSSL_free(der);
+  return bytes;
+}
+
+Bytes SignDigestWith(const std::string& keyPath, const EVP_MD* md, const Bytes& digest) {
+  PkeyPtr key = LoadKey(keyPath);
+  std::unique_ptr<EVP_PKEY_CTX, Deleter<EVP_PKEY_CTX_free>> ctx(EVP_PKEY_CTX_new(key.get(), nullptr));
+  Check(ctx && EVP_PKEY_sign_init(ctx.get()) == 1 &&
+            EVP_PKEY_CTX_set_signature_md(ctx.get(), md) == 1,
+        "sign init");
+  if (EVP_PKEY_get_base_id(key.get()) == EVP_PKEY_RSA) {
+    Check(EVP_PKEY_CTX_set_rsa_padding(ctx.get(), RSA_PKCS1_PADDING) == 1, "padding");
+  }
+  size_t length = 0;
+  Check(EVP_PKEY_sign(ctx.get(), nullptr, &length, digest.data(), digest.size()) == 1, "size");
+  Bytes signature(length);
+  Check(EVP_PKEY_sign(ctx.get(), signature.data(), &length, digest.data(), digest.size()) == 1,
+        "sign");
+  signature.resize(length);
+  return signature;
+}
+
+}  // namespace brisvale::testing
