@@ -1,0 +1,398 @@
+// The Linux transport over real sockets in a temporary directory: an echo service
+// built on it, well-behaved and misbehaving clients side by side.
+#include <fcntl.h>
+#include <stdlib.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <filesystem>
+#include <mutex>
+#include <thread>
+
+#include "base/runloop.h"
+#include "platform/linux/ipc_client.h"
+#include "platform/linux/ipc_frame.h"
+#include "platform/linux/ipc_linux.h"
+#include "platform/linux/ipc_socket.h"
+
+namespace brisvale::ipc {
+namespace {
+
+using namespace std::chrono_literals;
+using Bytes = std::vector<uint8_t>;
+
+constexpr char kEntitlementKey[] = "com.vantrel.private.brisvale.allowedSPI";
+
+std::string Text(const plist::Dictionary& body, std::string_view key) {
+  const plist::Value* value = body.find(key);
+  return value && value->string() ? *value->string() : std::string();
+}
+
+bool WaitUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout = 3s) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (!done()) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(2ms);
+  }
+  return true;
+}
+
+// A client that speaks raw bytes, for the misbehaving cases.
+struct RawPeer {
+  UniqueFd fd;
+  FrameReader reader;
+
+  explicit RawPeer(const std::string& path) : fd(ConnectToPath(path, nullptr)) {}
+  void Write(const Bytes& bytes) const {
+    ASSERT_EQ(send(fd.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL), ssize_t(bytes.size()));
+  }
+  // The next frames, or none when the service closed the connection first.
+  std::optional<std::vector<plist::Dictionary>> Read(size_t count, std::chrono::milliseconds timeout = 3s) {
+    std::vector<plist::Dictionary> frames;
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (frames.size() < count && std::chrono::steady_clock::now() < deadline) {
+      uint8_t buffer[4096];
+      const ssize_t n = recv(fd.get(), buffer, sizeof buffer, MSG_DONTWAIT);
+      if (n == 0) return std::nullopt;
+      if (n < 0) {
+        std::this_thread::sleep_for(1ms);
+        continue;
+      }
+      reader.Feed(std::span<const uint8_t>(buffer, size_t(n)), frames);
+    }
+    return frames;
+  }
+  // True when the service closes the connection within `timeout`.
+  bool ClosedWithin(std::chrono::milliseconds timeout) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (std::chrono::steady_clock::now() < deadline) {
+      uint8_t buffer[4096];
+      const ssize_t n = recv(fd.get(), buffer, sizeof buffer, MSG_DONTWAIT);
+      if (n == 0 || (n < 0 && errno == ECONNRESET)) return true;
+      std::this_thread::sleep_for(1ms);
+    }
+    return false;
+  }
+};
+
+Bytes FrameOf(const plist::Dictionary& body) { return *EncodeFrame(body); }
+
+Bytes Header(uint32_t length) {
+  return {uint8_t(length >> 24), uint8_t(length >> 16), uint8_t(length >> 8), uint8_t(length)};
+}
+
+class TransportTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/ipc-transport-XXXXXX";
+    ASSERT_TRUE(mkdtemp(pattern));
+    dir_ = pattern;
+    chmod(dir_.c_str(), 0755);  // a poster running as another user must reach the sockets
+    options_.socketDirectory = dir_ + "/run/vexa";
+    options_.partialFrameTimeout = 300ms;
+    options_.outgoingQueueLimit = 256 * 1024;
+    options_.kernelDeviceEvents = false;
+  }
+
+  void TearDown() override {
+    if (loop_) loop_->Stop();
+    if (thread_.joinable()) thread_.join();
+    streams_.clear();
+    listener_.reset();
+    service_.reset();
+    std::filesystem::remove_all(dir_);
+  }
+
+  std::string SocketPath() const { return ServiceSocketPath(options_, "echo"); }
+
+  // Starts the echo service and runs the loop on its own thread; `beforeRun` may
+  // register event streams while the loop is still idle.
+  void Start(const std::function<void()>& beforeRun = {}) {
+    // The loop is made here, not with the fixture, so that a test can place a socket
+    // on descriptor 3 first, as a launcher would.
+    loop_ = std::make_unique<RunLoop>();
+    service_ = CreateLinuxIpcService(*loop_, options_);
+    listener_ = service_->CreateListener("echo");
+    ASSERT_TRUE(listener_);
+    listener_->Resume([this](std::shared_ptr<Connection> connection, EventKind) {
+      std::weak_ptr<Connection> weak = connection;
+      connection->Resume([this, weak](EventKind kind, const Message* message) {
+        auto connection = weak.lock();
+        if (kind == EventKind::ConnectionInvalid) ++invalidEvents_;
+        if (kind == EventKind::Message && connection) Echo(*connection, *message);
+      });
+    });
+    if (beforeRun) beforeRun();
+    thread_ = std::thread([this] { loop_->Run(); });
+  }
+
+  void Echo(Connection& connection, const Message& message) {
+    const std::string command = Text(message.body, "Command");
+    {
+      std::lock_guard lock(mutex_);
+      handled_.push_back(Text(message.body, "Tag"));
+    }
+    if (command == "Drop") return connection.Cancel();
+    if (command == "Ignore") return;
+    if (command == "Slow") std::this_thread::sleep_for(150ms);
+    Message reply = *CreateReply(message);
+    reply.body = message.body;
+    reply.body.set("PeerPid", plist::Value::Int(connection.PeerPid()));
+    reply.body.set("PeerUid", plist::Value::Int(connection.PeerUid()));
+    reply.body.set("PeerPath", connection.PeerExecutablePath());
+    if (auto entitlement = connection.CopyEntitlement(kEntitlementKey)) reply.body.set("Entitlement", *entitlement);
+    if (command == "Big") reply.body.set("Blob", plist::Value(Bytes(64 * 1024, 0x5A)));
+    connection.Send(reply);
+  }
+
+  ClientReply Ask(plist::Dictionary body, std::chrono::milliseconds timeout = 3s) {
+    ClientReply failure;
+    std::optional<Client> client = Client::Connect(SocketPath(), &failure);
+    if (!client) return failure;
+    return client->Request(body, timeout);
+  }
+
+  std::vector<std::string> Handled() {
+    std::lock_guard lock(mutex_);
+    return handled_;
+  }
+
+  std::string dir_;
+  IpcOptions options_;
+  std::unique_ptr<RunLoop> loop_;
+  std::unique_ptr<IpcService> service_;
+  std::unique_ptr<Listener> listener_;
+  std::vector<std::unique_ptr<EventStream>> streams_;
+  std::thread thread_;
+  std::atomic<int> invalidEvents_{0};
+  std::mutex mutex_;
+  std::vector<std::string> handled_;
+};
+
+TEST_F(TransportTest, EchoesWithThePeerIdentityAndTellsFailuresApart) {
+  ClientReply before = Ask({{"Tag", "a"}});
+  EXPECT_EQ(before.status, ClientStatus::NotRunning);
+  EXPECT_NE(before.error.find("not running"), std::string::npos) << before.error;
+
+  Start();
+  struct stat status {};
+  ASSERT_EQ(stat(SocketPath().c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 0777, 0666u);
+  ASSERT_EQ(stat(options_.socketDirectory.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 0777, 0755u);
+
+  ClientReply reply = Ask({{"Tag", "a"}, {"Payload", plist::Value(Bytes{1, 2, 3})}});
+  ASSERT_TRUE(reply.ok()) << reply.error;
+  EXPECT_EQ(reply.body.find("Payload")->data()->size(), 3u);
+  EXPECT_FALSE(reply.body.find("vexa.reply-to")) << "transport keys stay in the transport";
+  EXPECT_EQ(reply.body.find("PeerPid")->integer()->value, getpid());
+  EXPECT_EQ(reply.body.find("PeerUid")->integer()->value, int64_t(getuid()));
+  EXPECT_EQ(Text(reply.body, "PeerPath"), std::filesystem::read_symlink("/proc/self/exe").string());
+  EXPECT_FALSE(reply.body.find("Entitlement"));
+
+  EXPECT_EQ(Ask({{"Command", "Drop"}}).status, ClientStatus::Cancelled);
+  EXPECT_EQ(Ask({{"Command", "Ignore"}}, 100ms).status, ClientStatus::TimedOut);
+}
+
+TEST_F(TransportTest, RepliesAreAddressedAndKeepRequestOrder) {
+  Start();
+  RawPeer peer(SocketPath());
+  Bytes burst;
+  for (const plist::Dictionary& body :
+       {plist::Dictionary{{"vexa.id", plist::Value::Int(10)}, {"Tag", "1"}, {"Command", "Slow"}},
+        plist::Dictionary{{"Tag", "2"}}, plist::Dictionary{{"vexa.id", plist::Value::Int(30)}, {"Tag", "3"}}}) {
+    Bytes frame = FrameOf(body);
+    burst.insert(burst.end(), frame.begin(), frame.end());
+  }
+  peer.Write(burst);
+  auto replies = peer.Read(3);
+  ASSERT_TRUE(replies);
+  ASSERT_EQ(replies->size(), 3u);
+  EXPECT_EQ(Text((*replies)[0], "Tag"), "1");
+  EXPECT_EQ((*replies)[0].find("vexa.reply-to")->integer()->value, 10);
+  EXPECT_EQ(Text((*replies)[1], "Tag"), "2");
+  EXPECT_FALSE((*replies)[1].find("vexa.reply-to")) << "a request without an id gets a reply without one";
+  EXPECT_EQ((*replies)[2].find("vexa.reply-to")->integer()->value, 30);
+}
+
+TEST_F(TransportTest, OverlappingClientsAreServedInArrivalOrder) {
+  Start();
+  std::optional<Client> first = Client::Connect(SocketPath());
+  std::optional<Client> second = Client::Connect(SocketPath());
+  ASSERT_TRUE(first && second);
+  std::optional<int64_t> firstId = first->Send({{"Tag", "first"}, {"Command", "Slow"}});
+  ASSERT_TRUE(WaitUntil([&] { return Handled().size() == 1; }));
+  std::optional<int64_t> secondId = second->Send({{"Tag", "second"}});
+  ASSERT_TRUE(firstId && secondId);
+  EXPECT_TRUE(second->WaitForReply(*secondId, 3s).ok());
+  EXPECT_TRUE(first->WaitForReply(*firstId, 3s).ok());
+  EXPECT_EQ(Handled(), (std::vector<std::string>{"first", "second"}));
+}
+
+TEST_F(TransportTest, MalformedInputCancelsOnlyThatConnection) {
+  Start();
+  const Bytes valid = FrameOf({{"Tag", "x"}});
+  struct Case {
+    const char* name;
+    Bytes bytes;
+  };
+  const Case cases[] = {
+      {"garbage payload", {0, 0, 0, 5, 'h', 'e', 'l', 'l', 'o'}},
+      {"length above 4 MiB", Header((4u << 20) + 1)},
+      {"zero length", Header(0)},
+      {"array frame", [] {
+         Bytes payload = plist::WriteBinary(plist::Array{"a"});
+         Bytes frame = Header(uint32_t(payload.size()));
+         frame.insert(frame.end(), payload.begin(), payload.end());
+         return frame;
+       }()},
+      {"id that is not an integer", FrameOf({{"vexa.id", "one"}})},
+      {"half a frame, then silence", Bytes(valid.begin(), valid.end() - 3)},
+  };
+  std::optional<Client> bystander = Client::Connect(SocketPath());
+  ASSERT_TRUE(bystander);
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    const int invalidBefore = invalidEvents_;
+    RawPeer bad(SocketPath());
+    bad.Write(c.bytes);
+    EXPECT_TRUE(bystander->Request({{"Tag", "bystander"}}, 3s).ok());
+    EXPECT_TRUE(bad.ClosedWithin(2s));
+    EXPECT_TRUE(WaitUntil([&] { return invalidEvents_ == invalidBefore + 1; }));
+    EXPECT_TRUE(bystander->Request({{"Tag", "bystander"}}, 3s).ok());
+  }
+  std::this_thread::sleep_for(50ms);
+  EXPECT_EQ(invalidEvents_, int(std::size(cases))) << "one event per cancelled connection";
+}
+
+TEST_F(TransportTest, PartialFrameTimeoutCountsSilenceNotTotalTime) {
+  Start();
+  RawPeer slow(SocketPath());
+  const Bytes frame = FrameOf({{"Tag", "slow"}});
+  // Trickled over about twice the timeout, never silent for long.
+  const size_t step = frame.size() / 6 + 1;
+  for (size_t pos = 0; pos < frame.size(); pos += step) {
+    slow.Write(Bytes(frame.begin() + pos, frame.begin() + std::min(frame.size(), pos + step)));
+    std::this_thread::sleep_for(100ms);
+  }
+  auto replies = slow.Read(1);
+  ASSERT_TRUE(replies);
+  ASSERT_EQ(replies->size(), 1u);
+
+  RawPeer stalled(SocketPath());
+  const auto start = std::chrono::steady_clock::now();
+  stalled.Write(Bytes(frame.begin(), frame.begin() + 6));
+  ASSERT_TRUE(stalled.ClosedWithin(2s));
+  EXPECT_GE(std::chrono::steady_clock::now() - start, 250ms);
+}
+
+TEST_F(TransportTest, PeerThatNeverReadsIsCancelledWithoutStallingOthers) {
+  Start();
+  RawPeer hoarder(SocketPath());
+  int one = 1;
+  setsockopt(hoarder.fd.get(), SOL_SOCKET, SO_RCVBUF, &one, sizeof one);  // smallest the kernel allows
+  const Bytes request = FrameOf({{"Command", "Big"}});
+  for (int i = 0; i < 64; ++i) {
+    if (send(hoarder.fd.get(), request.data(), request.size(), MSG_NOSIGNAL | MSG_DONTWAIT) < 0) break;
+    ASSERT_TRUE(Ask({{"Tag", "meanwhile"}}, 1s).ok());
+  }
+  // Reading now drains what was queued; only a cancelled connection then ends.
+  EXPECT_TRUE(hoarder.ClosedWithin(3s)) << "the hoarder was never cancelled";
+  EXPECT_TRUE(Ask({{"Tag", "after"}}).ok());
+}
+
+TEST_F(TransportTest, SocketActivationServesThePassedDescriptor) {
+  const int saved = fcntl(3, F_DUPFD_CLOEXEC, 10);  // whatever fd 3 was, it comes back afterwards
+  const std::string activatedPath = dir_ + "/activated";
+  UniqueFd listening = ListenOnPath(activatedPath, nullptr);
+  ASSERT_TRUE(listening);
+  UniqueFd moved(fcntl(listening.get(), F_DUPFD_CLOEXEC, 20));  // it may have landed on 3 itself
+  listening.Reset();
+  ASSERT_EQ(dup2(moved.get(), 3), 3);
+  moved.Reset();
+  setenv("LISTEN_PID", std::to_string(getpid()).c_str(), 1);
+  setenv("LISTEN_FDS", "1", 1);
+
+  Start();
+  EXPECT_EQ(getenv("LISTEN_PID"), nullptr);
+  EXPECT_EQ(getenv("LISTEN_FDS"), nullptr);
+  EXPECT_FALSE(std::filesystem::exists(SocketPath())) << "the passed socket replaces binding";
+  std::optional<Client> client = Client::Connect(activatedPath);
+  ASSERT_TRUE(client);
+  EXPECT_TRUE(client->Request({{"Tag", "activated"}}, 3s).ok());
+
+  loop_->Stop();
+  thread_.join();
+  listener_.reset();
+  if (saved >= 0) {
+    dup2(saved, 3);
+    close(saved);
+  }
+}
+
+// Root only: trusted.* attributes and the events socket's peer check need it.
+class RootTransportTest : public TransportTest {
+ protected:
+  void SetUp() override {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root";
+    TransportTest::SetUp();
+  }
+};
+
+TEST_F(RootTransportTest, EntitlementsComeFromTheCallersExecutable) {
+  const std::string tool = dir_ + "/entitled-tool";
+  std::filesystem::copy_file(IPC_TEST_PEER, tool);
+  std::filesystem::permissions(tool, std::filesystem::perms(0755));
+  const std::string entitlements =
+      plist::WriteXml(plist::Dictionary{{kEntitlementKey, plist::Array{"CopyDevices", "SyncDevice"}}});
+  if (setxattr(tool.c_str(), "trusted.vexa.entitlements", entitlements.data(), entitlements.size(), 0) != 0) {
+    GTEST_SKIP() << "trusted extended attributes unsupported here: " << strerror(errno);
+  }
+  Start();
+  const pid_t child = fork();
+  if (child == 0) {
+    execl(tool.c_str(), tool.c_str(), SocketPath().c_str(), static_cast<char*>(nullptr));
+    _exit(127);
+  }
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0) << "the entitled tool did not receive the entitlement it expected";
+}
+
+TEST_F(RootTransportTest, EventsFromRootPostersReachTheirStreamOnly) {
+  std::vector<std::optional<std::string>> received;
+  std::mutex receivedMutex;
+  Start([&] {
+    streams_.push_back(service_->RegisterEventStream("com.example.wanted", [&](const StreamEvent& event) {
+      std::lock_guard lock(receivedMutex);
+      received.push_back(event.name);
+    }));
+  });
+
+  const std::string events = EventsSocketPath(options_);
+  ClientReply posted = PostEvent(events, "com.example.wanted", "first");
+  EXPECT_TRUE(posted.ok()) << posted.error;
+  EXPECT_TRUE(PostEvent(events, "com.example.other", "elsewhere").ok());
+
+  const pid_t child = fork();
+  if (child == 0) {
+    if (setuid(65534) != 0) _exit(2);
+    _exit(PostEvent(events, "com.example.wanted", "from a user", 2s).status == ClientStatus::Cancelled ? 0 : 1);
+  }
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "a non-root poster was not refused";
+
+  std::lock_guard lock(receivedMutex);
+  EXPECT_EQ(received, (std::vector<std::optional<std::string>>{"first"}));
+}
+
+}  // namespace
+}  // namespace brisvale::ipc
