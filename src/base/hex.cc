@@ -59,6 +59,17 @@ std::optional<char32_t> DecodeUtf8(std::string_view& text) {
   return value;
 }
 
+// General category letter (L*), mark (M*) or number (N*).
+bool IsLetterMarkOrNumber(char32_t codePoint) {
+  const auto* end = std::end(kLetterMarkNumberRanges);
+  const auto* range = std::upper_bound(
+      std::begin(kLetterMarkNumberRanges), end, codePoint,
+      [](char32_t value, const CodePointRange& candidate) { return value < candidate.first; });
+  if (range == std::begin(kLetterMarkNumberRanges)) return false;
+  --range;
+  return codePoint <= range->last;
+}
+
 // The text as UTF-16 code units, or none when it is not valid UTF-8 or holds a
 // character outside the letters, marks and digits.
 std::optional<std::u16string> AlphanumericUtf16(std::string_view text) {
@@ -92,16 +103,6 @@ char HexDigit(uint8_t nibble) {
 }
 
 }  // namespace
-
-bool IsLetterMarkOrNumber(char32_t codePoint) {
-  const auto* end = std::end(kLetterMarkNumberRanges);
-  const auto* range = std::upper_bound(
-      std::begin(kLetterMarkNumberRanges), end, codePoint,
-      [](char32_t value, const CodePointRange& candidate) { return value < candidate.first; });
-  if (range == std::begin(kLetterMarkNumberRanges)) return false;
-  --range;
-  return codePoint <= range->last;
-}
 
 std::optional<std::vector<uint8_t>> initDataWithHexString(std::optional<std::string_view> text) {
   if (!text) return std::nullopt;

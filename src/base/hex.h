@@ -35,7 +35,4 @@ inline std::optional<std::string> hexStringWithData(std::optional<std::span<cons
   return initHexStringWithData(data);
 }
 
-// Whether `codePoint` has a general category of letter (L*), mark (M*) or number (N*).
-bool IsLetterMarkOrNumber(char32_t codePoint);
-
 }  // namespace brisvale::BrisvaleMounter
