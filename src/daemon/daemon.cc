@@ -4,11 +4,18 @@
 #include "base/runloop.h"
 #include "daemon/dispatcher.h"
 #include "daemon/request_handlers.h"
+#include "platform/device_registry.h"
+#include "platform/services.h"
 
 namespace brisvale {
 namespace {
 
 const char* NameOr(const std::optional<std::string>& text) { return text ? text->c_str() : nullptr; }
+
+// Devices attached a moment ago must be in the registry before anything looks there.
+void RefreshRegistry(registry::RefreshReason reason) {
+  if (registry::DeviceRegistry* registry = CurrentServices().registry) registry->Refresh(reason);
+}
 
 }  // namespace
 
@@ -56,6 +63,7 @@ void Daemon::HandleListenerEvent(std::shared_ptr<ipc::Connection> connection,
 void Daemon::HandleConnectionEvent(const std::shared_ptr<ipc::Connection>& connection,
                                    ipc::EventKind kind, const ipc::Message* message) {
   if (kind == ipc::EventKind::Message && message) {
+    RefreshRegistry(registry::RefreshReason::Request);
     if (!HandleRequest(context_, connection.get(), *message)) connection->Cancel();
     return;
   }
@@ -71,6 +79,7 @@ void Daemon::HandleConnectionEvent(const std::shared_ptr<ipc::Connection>& conne
 
 void Daemon::HandleHardwareEvent(const ipc::StreamEvent& event) {
   if (!event.name) return;
+  RefreshRegistry(registry::RefreshReason::HardwareEvent);
   const std::string& name = *event.name;
   Log(Level::Debug, "Kestrix Event: %@", name);
   if (name == kCameraEvent) {

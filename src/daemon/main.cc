@@ -14,6 +14,11 @@
 #include "daemon/stale_mount_points.h"
 #include "platform/linux/ipc_linux.h"
 #include "platform/linux/os_sandbox.h"
+#include "platform/os.h"
+#include "platform/services.h"
+#include "platform/system_devices.h"
+#include "registry/registry_model.h"
+#include "registry/simulated_devices.h"
 
 namespace {
 
@@ -99,11 +104,35 @@ int main(int argc, char** argv) {
   }
 
   RunLoop loop;
+  registry::RegistryModel registry;
+  std::unique_ptr<registry::SystemDevices> systemDevices =
+      registry::StartSystemDevices(registry, &loop, registry::SystemDevicesOptions{});
+  std::optional<registry::SimulatedDevices> simulatedDevices;
+  if (options->devicesFile) {
+    simulatedDevices.emplace(registry, *options->devicesFile);
+    if (!simulatedDevices->Reload(&error)) {
+      std::fprintf(stderr, "brisvale-mounterd: cannot read %s: %s\n",
+                   options->devicesFile->c_str(), error.c_str());
+      return kExitUsage;
+    }
+  }
+  std::unique_ptr<ipc::IpcService> ipc = CreateLinuxIpcService(loop, IpcOptions{});
+  ScopedServices services(Services{&registry, &os::SystemOs(), ipc.get()});
+
+  // Without the port no media or camera notification could ever arrive: a daemon that
+  // cannot create it would serve requests but silently ignore hardware, so it stops.
   MatchingContext context;
+  auto port = registry.CreateNotificationPort();
+  if (!port.ok() || !port.value) {
+    Log(Level::Default, "Failed to create registry notification port: 0x%04x",
+        port.status & 0x3FFF);
+    return 1;
+  }
+  context.notificationPort = std::move(port.value);
+  context.notificationPort->Attach(loop);
 
   for (const char* root : kStaleMountRoots) RemoveStaleMountPoints(root);
 
-  std::unique_ptr<ipc::IpcService> ipc = CreateLinuxIpcService(loop, IpcOptions{});
   Daemon daemon(loop, *ipc, context, [](int status) { std::exit(status); });
   if (!daemon.StartServing()) return 1;
   loop.Run();

@@ -3,14 +3,16 @@
 // One instance lives for the whole process and is shared by reference.
 #pragma once
 
-#include <cstdint>
+#include <memory>
+
+#include "platform/device_registry.h"
 
 namespace brisvale {
 
 struct MatchingContext {
-  uint32_t notificationPort = 0;
-  uint32_t mediaIterator = 0;   // 0 = no media subscription yet
-  uint32_t cameraIterator = 0;  // 0 = no camera subscription yet
+  std::unique_ptr<registry::NotificationPort> notificationPort;
+  std::unique_ptr<registry::Iterator> mediaIterator;   // none until media are subscribed
+  std::unique_ptr<registry::Iterator> cameraIterator;  // none until cameras are subscribed
 };
 
 }  // namespace brisvale
