@@ -325,6 +325,8 @@ void AppendEscaped(std::string& out, std::string_view text) {
     std::optional<char32_t> cp = internal::DecodeUtf8(text, pos);
     // XML 1.0 cannot carry control characters, U+FFFE/U+FFFF or broken UTF-8 at all;
     // they become the replacement character rather than making the document unreadable.
+    // (Two keys that differ only in such characters then collide, and the reader
+    // refuses the duplicate.)
     if (!cp) {
       ++pos;
       internal::AppendUtf8(out, 0xFFFD);
