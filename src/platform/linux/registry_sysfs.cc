@@ -255,6 +255,7 @@ std::optional<uint32_t> UsbLocationId(std::string_view kernelName) {
   uint32_t location = static_cast<uint32_t>(*bus) << 24;
   std::string_view ports = kernelName.substr(dash + 1);
   if (ports == "0") return location;  // the root hub
+  if (ports.empty()) return std::nullopt;
   int shift = 20;
   while (!ports.empty()) {
     size_t dot = ports.find('.');

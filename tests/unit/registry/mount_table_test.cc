@@ -1,0 +1,41 @@
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <fstream>
+
+#include "platform/linux/os_system.h"
+
+namespace brisvale::os {
+namespace {
+
+TEST(MountTable, CountThenFillDecodesPathsAndReadsTheReadOnlyFlag) {
+  char name[] = "/tmp/brisvale-mountinfo-XXXXXX";
+  int fd = mkstemp(name);
+  ASSERT_GE(fd, 0);
+  close(fd);
+  std::ofstream(name)
+      << "22 1 254:0 / / rw,relatime shared:1 - ext4 /dev/vda rw\n"
+         "40 22 0:35 / /private/var/mnt/my\\040stick rw,nosuid - tmpfs tmp\\040fs rw\n"
+         "41 22 7:3 / /Developer ro,nodev - ext4 /dev/loop3 ro\n"
+         "42 22 7:4 / /private/var/factory_mount rw - erofs /dev/loop4 ro\n"
+         "43 22 0:36 / /proc rw - proc none rw\n";
+
+  EXPECT_EQ(ReadMountTable(name, {}), 5);
+  std::vector<MountRecord> records(6);
+  ASSERT_EQ(ReadMountTable(name, records), 5);
+  EXPECT_EQ(records[1], (MountRecord{0, "tmpfs", "/private/var/mnt/my stick", "tmp fs"}));
+  EXPECT_EQ(records[2], (MountRecord{kMountReadOnly, "ext4", "/Developer", "/dev/loop3"}));
+  // Read-only in the file system's own options counts too.
+  EXPECT_EQ(records[3].flags, kMountReadOnly);
+  EXPECT_EQ(records[0].flags, 0u);
+
+  // A buffer smaller than the table takes the first records only.
+  std::vector<MountRecord> two(2);
+  EXPECT_EQ(ReadMountTable(name, two), 2);
+  EXPECT_EQ(two[1].mountedOn, "/private/var/mnt/my stick");
+  unlink(name);
+  EXPECT_LT(ReadMountTable(name, {}), 0);
+}
+
+}  // namespace
+}  // namespace brisvale::os

@@ -1,0 +1,187 @@
+#include "registry/simulated_devices.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <fstream>
+
+#include "base/log.h"
+#include "base/runloop.h"
+
+namespace brisvale::registry {
+namespace {
+
+using namespace std::chrono_literals;
+
+// A devices file with a USB stick with one partition and a camera, either optional.
+std::string DevicesFile(bool withStick, bool withCamera, bool stickWritable = false) {
+  std::string camera = R"(
+    <dict>
+      <key>Name</key><string>camera</string>
+      <key>Class</key><string>KxUSBHostDevice</string>
+      <key>Properties</key><dict><key>removable</key><true/></dict>
+      <key>Children</key><array><dict>
+        <key>Class</key><array><string>KxUSBHostInterface</string><string>KxUSBInterface</string></array>
+        <key>Properties</key><dict>
+          <key>bInterfaceClass</key><integer>6</integer>
+          <key>bInterfaceSubClass</key><integer>1</integer>
+          <key>bInterfaceProtocol</key><integer>1</integer>
+          <key>locationID</key><integer>33554432</integer>
+        </dict>
+      </dict></array>
+    </dict>)";
+  std::string stick = std::string(R"(
+  <dict>
+    <key>Name</key><string>stick</string>
+    <key>Class</key><string>KxUSBHostDevice</string>
+    <key>Properties</key><dict><key>removable</key><true/></dict>
+    <key>Children</key><array><dict>
+      <key>Name</key><string>disk</string>
+      <key>Class</key><string>KxMedia</string>
+      <key>Properties</key><dict>
+        <key>BSD Name</key><string>disk9</string><key>Leaf</key><false/>
+        <key>Content</key><string>GPT_partition_scheme</string>
+      </dict>
+      <key>Children</key><array><dict>
+        <key>Name</key><string>data</string>
+        <key>Class</key><string>KxMedia</string>
+        <key>Properties</key><dict>
+          <key>BSD Name</key><string>disk9s1</string><key>Leaf</key><true/>
+          <key>Writable</key>)") +
+         (stickWritable ? "<true/>" : "<false/>") + R"(
+        </dict>
+      </dict></array>
+    </dict></array>
+  </dict>)";
+  return std::string(R"(<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><dict><key>Objects</key><array>)") +
+         (withStick ? stick : "") + (withCamera ? camera : "") + "\n</array></dict></plist>\n";
+}
+
+class SimulatedDevicesTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char name[] = "/tmp/brisvale-devices-XXXXXX";
+    int fd = mkstemp(name);
+    ASSERT_GE(fd, 0);
+    close(fd);
+    path = name;
+  }
+  void TearDown() override { unlink(path.c_str()); }
+  void Write(const std::string& text) { std::ofstream(path, std::ios::trunc) << text; }
+
+  std::string path;
+  RunLoop loop;
+  RegistryModel model;
+};
+
+TEST_F(SimulatedDevicesTest, ReloadPublishesAddsAndTerminatesByPathInTheTree) {
+  Write(DevicesFile(true, false));
+  SimulatedDevices devices(model, path);
+  ASSERT_TRUE(devices.Reload());
+  ObjectRef data = devices.Find({"stick", "disk", "data"});
+  ASSERT_NE(data, nullptr);
+  EXPECT_EQ(SearchProperty(data, "removable"), plist::Value::Bool(true));
+  EXPECT_EQ(data->Parent().value, devices.Find({"stick", "disk"}));
+
+  auto port = model.CreateNotificationPort().value;
+  port->Attach(loop);
+  std::vector<std::string> cameras;
+  auto subscription = model.AddMatchingNotification(
+      *port, MatchKind::FirstMatch,
+      Matching::Class("KxUSBInterface").Set("bInterfaceClass", plist::Value::Int(6)),
+      [&](Iterator& it) {
+        while (ObjectRef object = it.Next()) cameras.push_back(object->ClassName());
+      });
+  EXPECT_EQ(subscription.value->Next(), nullptr);
+  std::vector<uint32_t> stickMessages;
+  auto removal = model.AddInterestNotification(
+      *port, data, [&](const ObjectRef&, uint32_t message) { stickMessages.push_back(message); });
+
+  // Plug the camera in, make the stick writable: the stick keeps its objects.
+  Write(DevicesFile(true, true, true));
+  model.Refresh(RefreshReason::Request);  // requests do not re-read the file
+  EXPECT_EQ(devices.Find({"camera"}), nullptr);
+  model.Refresh(RefreshReason::HardwareEvent);
+  loop.RunFor(20ms);
+  EXPECT_EQ(cameras, std::vector<std::string>{"KxUSBHostInterface"});
+  EXPECT_EQ(devices.Find({"stick", "disk", "data"}), data);
+  EXPECT_EQ(data->Property("Writable"), plist::Value::Bool(true));
+  ASSERT_NE(devices.Find({"camera", "#0"}), nullptr);
+  EXPECT_TRUE(devices.Find({"camera", "#0"})->ConformsTo("KxUSBInterface"));
+
+  // Pull the stick: its whole subtree goes, the camera stays.
+  Write(DevicesFile(false, true));
+  ASSERT_TRUE(devices.Reload());
+  loop.RunFor(20ms);
+  EXPECT_TRUE(data->IsTerminated());
+  EXPECT_EQ(devices.Find({"stick"}), nullptr);
+  EXPECT_EQ(stickMessages, std::vector<uint32_t>{kMessageServiceIsTerminated});
+  EXPECT_NE(devices.Find({"camera"}), nullptr);
+  EXPECT_EQ(cameras.size(), 1u) << "the camera that stayed is not matched again";
+}
+
+TEST_F(SimulatedDevicesTest, UnusableFileKeepsTheRegistryAndSaysWhy) {
+  Write(DevicesFile(true, true));
+  SimulatedDevices devices(model, path);
+  ASSERT_TRUE(devices.Reload());
+  size_t published = model.ObjectCount();
+
+  struct Case {
+    const char* label;
+    std::string text;
+    const char* reason;
+  };
+  const Case cases[] = {
+      {"not a property list", "garbage", ""},
+      {"top level", "<plist><array/></plist>", "the top level is not a dictionary"},
+      {"no objects", "<plist><dict/></plist>", "\"Objects\" is missing or not an array"},
+      {"no class", "<plist><dict><key>Objects</key><array><dict/></array></dict></plist>",
+       "object /#0: has no \"Class\""},
+      {"duplicate names",
+       "<plist><dict><key>Objects</key><array>"
+       "<dict><key>Name</key><string>a</string><key>Class</key><string>KxMedia</string></dict>"
+       "<dict><key>Name</key><string>a</string><key>Class</key><string>KxMedia</string></dict>"
+       "</array></dict></plist>",
+       "object /a: has a duplicate name"},
+      {"bad children",
+       "<plist><dict><key>Objects</key><array><dict><key>Class</key><string>KxMedia</string>"
+       "<key>Children</key><string>x</string></dict></array></dict></plist>",
+       "object /#0: \"Children\" is not an array"},
+      {"contradicting class chain",
+       "<plist><dict><key>Objects</key><array><dict><key>Class</key><array>"
+       "<string>KxUSBHostInterface</string><string>KxMedia</string></array></dict>"
+       "</array></dict></plist>",
+       "object /#0: class KxUSBHostInterface does not derive from KxMedia"},
+  };
+  for (const auto& c : cases) {
+    Write(c.text);
+    log::CaptureSink capture;
+    std::string error;
+    EXPECT_FALSE(devices.Reload(&error)) << c.label;
+    if (*c.reason) {
+      EXPECT_EQ(error, c.reason) << c.label;
+    }
+    EXPECT_TRUE(capture.Contains(Level::Default, "Failed to read devices file " + path + ": " + error))
+        << c.label;
+    EXPECT_EQ(model.ObjectCount(), published) << c.label;
+  }
+  unlink(path.c_str());
+  EXPECT_FALSE(devices.Reload());
+  EXPECT_EQ(model.ObjectCount(), published);
+}
+
+TEST_F(SimulatedDevicesTest, GoingAwayTakesItsObjectsAlong) {
+  Write(DevicesFile(true, true));
+  {
+    SimulatedDevices devices(model, path);
+    ASSERT_TRUE(devices.Reload());
+    EXPECT_EQ(model.ObjectCount(), 5u);
+  }
+  EXPECT_EQ(model.ObjectCount(), 0u);
+  model.Refresh(RefreshReason::HardwareEvent);  // no dangling provider
+}
+
+}  // namespace
+}  // namespace brisvale::registry
