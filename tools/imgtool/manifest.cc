@@ -18,15 +18,15 @@ std::string FourCharCode(const std::string& text, const std::string& what) {
 }
 
 // TAG=int:N, TAG=bool:B, TAG=hex:BYTES or TAG=str:TEXT.
-Bytes TypedProperty(const std::string& spec, const std::string& what) {
-  size_t equals = spec.find('=');
-  size_t colon = spec.find(':', equals == std::string::npos ? 0 : equals);
+Bytes TypedProperty(const std::string& property, const std::string& what) {
+  size_t equals = property.find('=');
+  size_t colon = property.find(':', equals == std::string::npos ? 0 : equals);
   if (equals == std::string::npos || colon == std::string::npos) {
-    throw ToolError(what + ": expected TAG=int:N|bool:B|hex:BYTES|str:TEXT, got " + spec, true);
+    throw ToolError(what + ": expected TAG=int:N|bool:B|hex:BYTES|str:TEXT, got " + property, true);
   }
-  std::string tag = FourCharCode(spec.substr(0, equals), what);
-  std::string type = spec.substr(equals + 1, colon - equals - 1);
-  std::string value = spec.substr(colon + 1);
+  std::string tag = FourCharCode(property.substr(0, equals), what);
+  std::string type = property.substr(equals + 1, colon - equals - 1);
+  std::string value = property.substr(colon + 1);
   if (type == "int") return dw::IntegerProperty(tag, ParseNumber(value, what));
   if (type == "bool") return dw::BooleanProperty(tag, ParseBool(value, what));
   if (type == "hex") return dw::DataProperty(tag, ParseHex(value, what));
@@ -84,8 +84,8 @@ int BuildManifest(const std::vector<std::string>& args) {
   }
   manifestProperties.push_back(
       dw::IntegerProperty("SDOM", ParseNumber(options.Get("--sdom").value_or("1"), "--sdom")));
-  for (const std::string& spec : options.All("--property")) {
-    manifestProperties.push_back(TypedProperty(spec, "--property"));
+  for (const std::string& property : options.All("--property")) {
+    manifestProperties.push_back(TypedProperty(property, "--property"));
   }
 
   std::string subType = options.Get("--sub-type").value_or("DebugDiskImage");
@@ -96,8 +96,8 @@ int BuildManifest(const std::vector<std::string>& args) {
       dw::BooleanProperty("EKEY", ParseBool(options.Get("--ekey").value_or("true"), "--ekey")));
   object.properties.push_back(
       dw::DataProperty("pdnm", Bytes(subType.begin(), subType.end())));
-  for (const std::string& spec : options.All("--object-property")) {
-    object.properties.push_back(TypedProperty(spec, "--object-property"));
+  for (const std::string& property : options.All("--object-property")) {
+    object.properties.push_back(TypedProperty(property, "--object-property"));
   }
 
   // The SHA-1 chain is intermediate then leaf under the general root; the SHA-384 chain
@@ -115,8 +115,8 @@ int BuildManifest(const std::vector<std::string>& args) {
   if (!constraints.empty()) {
     if (leafKind == "plain") throw ToolError("--leaf-constraint needs the constrained leaf", true);
     std::vector<dw::Bytes> pinned;
-    for (const std::string& spec : constraints) {
-      pinned.push_back(TypedProperty(spec, "--leaf-constraint"));
+    for (const std::string& property : constraints) {
+      pinned.push_back(TypedProperty(property, "--leaf-constraint"));
     }
     certificates.push_back(MintLeafCertificate(
         issuer + ".key", issuer + ".der", leaf + ".key", bodyDigest,
