@@ -7,7 +7,6 @@
 #include <new>
 
 #include "qor4_test_support.h"
-#include "verify/der/der_item_specs.h"
 
 namespace {
 
@@ -84,10 +83,6 @@ TEST(NoAllocation, DecodeAndFullEvaluation) {
       {derwriter::Dictionary("MANP", {derwriter::IntegerProperty("BORD", 0x10)}),
        derwriter::Dictionary("OBJP", {derwriter::BooleanProperty("EKEY", true)})});
   const Bytes container = DefaultContainer();
-  const Bytes certificate = derwriter::Sequence(
-      {derwriter::Sequence({derwriter::Integer(5), derwriter::Sequence({derwriter::Oid("1.2.3")})}),
-       derwriter::Sequence({derwriter::Oid("1.2.840.113549.1.1.11")}),
-       derwriter::BitString(Bytes(64, 1))});
   int delivered = 0;
 
   g_allocations = 0;
@@ -99,16 +94,11 @@ TEST(NoAllocation, DecodeAndFullEvaluation) {
       Qor4Code("pdmg"), &context, &callbacks, &kFakeParams, &delivered);
   uint32_t type;
   const int getter = Qor4DecodeGetPayloadType(&context, &type);
-  const DERItem certificateItem = ItemOf(certificate);
-  DERSignedCertCrl signedCert;
-  const DERResult table = DERParseSequence(&certificateItem, DERNumSignedCertCrlItemSpecs,
-                                           DERSignedCertCrlItemSpecs, &signedCert, sizeof signedCert);
   g_counting = false;
 
   EXPECT_EQ(0, init);
   EXPECT_EQ(0, evaluation);
   EXPECT_EQ(0, getter);
-  EXPECT_EQ(DERResultSuccess, table);
   EXPECT_EQ(10, delivered);
   EXPECT_EQ(1, Slots().certificateCalls);
   EXPECT_EQ(0, g_allocations.load());
