@@ -14,49 +14,40 @@ namespace {
 
 using namespace std::chrono_literals;
 
+using plist::Dictionary;
+using plist::Value;
+
+Value Object(const char* name, Value cls, Dictionary properties, plist::Array children = {}) {
+  return Value(Dictionary{{"Name", Value(name)},
+                          {"Class", std::move(cls)},
+                          {"Properties", Value(std::move(properties))},
+                          {"Children", Value(std::move(children))}});
+}
+
 // A devices file with a USB stick with one partition and a camera, either optional.
 std::string DevicesFile(bool withStick, bool withCamera, bool stickWritable = false) {
-  std::string camera = R"(
-    <dict>
-      <key>Name</key><string>camera</string>
-      <key>Class</key><string>KxUSBHostDevice</string>
-      <key>Properties</key><dict><key>removable</key><true/></dict>
-      <key>Children</key><array><dict>
-        <key>Class</key><array><string>KxUSBHostInterface</string><string>KxUSBInterface</string></array>
-        <key>Properties</key><dict>
-          <key>bInterfaceClass</key><integer>6</integer>
-          <key>bInterfaceSubClass</key><integer>1</integer>
-          <key>bInterfaceProtocol</key><integer>1</integer>
-          <key>locationID</key><integer>33554432</integer>
-        </dict>
-      </dict></array>
-    </dict>)";
-  std::string stick = std::string(R"(
-  <dict>
-    <key>Name</key><string>stick</string>
-    <key>Class</key><string>KxUSBHostDevice</string>
-    <key>Properties</key><dict><key>removable</key><true/></dict>
-    <key>Children</key><array><dict>
-      <key>Name</key><string>disk</string>
-      <key>Class</key><string>KxMedia</string>
-      <key>Properties</key><dict>
-        <key>BSD Name</key><string>disk9</string><key>Leaf</key><false/>
-        <key>Content</key><string>GPT_partition_scheme</string>
-      </dict>
-      <key>Children</key><array><dict>
-        <key>Name</key><string>data</string>
-        <key>Class</key><string>KxMedia</string>
-        <key>Properties</key><dict>
-          <key>BSD Name</key><string>disk9s1</string><key>Leaf</key><true/>
-          <key>Writable</key>)") +
-         (stickWritable ? "<true/>" : "<false/>") + R"(
-        </dict>
-      </dict></array>
-    </dict></array>
-  </dict>)";
-  return std::string(R"(<?xml version="1.0" encoding="UTF-8"?>
-<plist version="1.0"><dict><key>Objects</key><array>)") +
-         (withStick ? stick : "") + (withCamera ? camera : "") + "\n</array></dict></plist>\n";
+  plist::Array objects;
+  Dictionary removable{{"removable", Value::Bool(true)}};
+  if (withStick) {
+    Value data = Object("data", "KxMedia",
+                        {{"BSD Name", Value("disk9s1")},
+                         {"Leaf", Value::Bool(true)},
+                         {"Writable", Value::Bool(stickWritable)}});
+    Value disk = Object("disk", "KxMedia",
+                        {{"BSD Name", Value("disk9")}, {"Leaf", Value::Bool(false)}}, {data});
+    objects.push_back(Object("stick", "KxUSBHostDevice", removable, {disk}));
+  }
+  if (withCamera) {
+    Value chain(plist::Array{Value("KxUSBHostInterface"), Value("KxUSBInterface")});
+    Value ptp(Dictionary{{"Class", chain},
+                         {"Properties", Value(Dictionary{
+                                            {"bInterfaceClass", Value::Int(6)},
+                                            {"bInterfaceSubClass", Value::Int(1)},
+                                            {"bInterfaceProtocol", Value::Int(1)},
+                                        })}});
+    objects.push_back(Object("camera", "KxUSBHostDevice", removable, {ptp}));
+  }
+  return plist::WriteXml(Value(Dictionary{{"Objects", Value(std::move(objects))}}));
 }
 
 class SimulatedDevicesTest : public ::testing::Test {

@@ -30,15 +30,6 @@ TEST(UsbLocationId, BusInTheTopByteThenOneNibblePerPort) {
   for (const auto& c : cases) EXPECT_EQ(UsbLocationId(c.name), c.expected) << c.name;
 }
 
-TEST(RegistryClasses, FollowTheSubsystem) {
-  EXPECT_EQ(ClassForSubsystem("block", "partition"), "KxMedia");
-  EXPECT_EQ(ClassForSubsystem("usb", "usb_interface"), "KxUSBHostInterface");
-  EXPECT_EQ(ClassForSubsystem("usb", "usb_device"), "KxUSBHostDevice");
-  EXPECT_EQ(ClassForSubsystem("scsi", "scsi_device"), "KxScsiDevice");
-  EXPECT_EQ(ClassForSubsystem("scsi_host", ""), "KxScsiHostDevice");
-  EXPECT_EQ(ClassForSubsystem("", ""), "KxSysfsDevice");
-}
-
 TEST(MediaContent, GuidsUpperCaseMbrTypesInHexSchemesByName) {
   EXPECT_EQ(PartitionContent("c12a7328-f81f-11d2-ba4b-00a0c93ec93b", 0),
             "C12A7328-F81F-11D2-BA4B-00A0C93EC93B");
