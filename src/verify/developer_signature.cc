@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "base/log.h"
+#include "base/unique_fd.h"
 
 namespace brisvale::verify {
 namespace {
@@ -19,19 +20,7 @@ namespace {
 // Paths go through a buffer of this size, terminator included.
 constexpr size_t kPathBufferSize = 1024;
 
-class FileDescriptor {
- public:
-  explicit FileDescriptor(int fd) : fd_(fd) {}
-  ~FileDescriptor() {
-    if (fd_ >= 0) close(fd_);
-  }
-  FileDescriptor(const FileDescriptor&) = delete;
-  FileDescriptor& operator=(const FileDescriptor&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
+using FileDescriptor = UniqueFd;
 
 }  // namespace
 

@@ -8,24 +8,13 @@
 #include <new>
 
 #include "base/log.h"
+#include "base/unique_fd.h"
 #include "platform/crypto.h"
 
 namespace brisvale::verify {
 namespace {
 
-class FileDescriptor {
- public:
-  explicit FileDescriptor(int fd) : fd_(fd) {}
-  ~FileDescriptor() {
-    if (fd_ >= 0) close(fd_);
-  }
-  FileDescriptor(const FileDescriptor&) = delete;
-  FileDescriptor& operator=(const FileDescriptor&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
+using FileDescriptor = UniqueFd;
 
 std::optional<plist::Bytes> DigestFile(std::string_view path, crypto::DigestAlgorithm algorithm) {
   if (path.empty()) {

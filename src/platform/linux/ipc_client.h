@@ -11,7 +11,7 @@
 #include <string_view>
 
 #include "base/plist.h"
-#include "platform/linux/ipc_fd.h"
+#include "base/unique_fd.h"
 #include "platform/linux/ipc_frame.h"
 
 namespace brisvale::ipc {

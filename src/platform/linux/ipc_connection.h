@@ -13,7 +13,7 @@
 
 #include "base/runloop.h"
 #include "platform/ipc_service.h"
-#include "platform/linux/ipc_fd.h"
+#include "base/unique_fd.h"
 #include "platform/linux/ipc_frame.h"
 #include "platform/linux/ipc_peer.h"
 

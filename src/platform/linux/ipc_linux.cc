@@ -27,7 +27,7 @@ class LinuxIpcService : public ipc::IpcService {
       : options_(std::move(options)),
         context_(std::make_shared<ipc::TransportContext>(loop, options_.partialFrameTimeout,
                                                          options_.outgoingQueueLimit)) {
-    ipc::UniqueFd activatedEvents;
+    UniqueFd activatedEvents;
     for (ipc::ActivatedSocket& socket : ipc::TakeActivatedSockets()) {
       if (socket.name == kActivatedEventsName) {
         activatedEvents = std::move(socket.fd);
@@ -50,14 +50,14 @@ class LinuxIpcService : public ipc::IpcService {
       return nullptr;
     }
     if (!activated_.empty()) {
-      ipc::UniqueFd socket = std::move(activated_.front());
+      UniqueFd socket = std::move(activated_.front());
       activated_.erase(activated_.begin());
       Log(Level::Debug, "Serving %s on the socket passed by the launcher", serviceName);
       return std::make_unique<ipc::LinuxListener>(context_, std::move(socket), std::string());
     }
     const std::string path = ServiceSocketPath(options_, serviceName);
     std::string error;
-    ipc::UniqueFd socket = ipc::ListenOnPath(path, &error);
+    UniqueFd socket = ipc::ListenOnPath(path, &error);
     if (!socket) {
       Log(Level::Default, "Cannot listen on %s: %s", path, error);
       return nullptr;
@@ -79,7 +79,7 @@ class LinuxIpcService : public ipc::IpcService {
   IpcOptions options_;
   std::shared_ptr<ipc::TransportContext> context_;
   std::shared_ptr<ipc::EventHub> hub_;
-  std::vector<ipc::UniqueFd> activated_;
+  std::vector<UniqueFd> activated_;
   std::atomic<int> transactions_{0};
 };
 

@@ -10,7 +10,7 @@
 #include "base/runloop.h"
 #include "platform/ipc_service.h"
 #include "platform/linux/ipc_connection.h"
-#include "platform/linux/ipc_fd.h"
+#include "base/unique_fd.h"
 
 namespace brisvale::ipc {
 

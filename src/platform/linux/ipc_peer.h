@@ -10,7 +10,7 @@
 #include <string_view>
 
 #include "base/plist.h"
-#include "platform/linux/ipc_fd.h"
+#include "base/unique_fd.h"
 
 namespace brisvale::ipc {
 

@@ -6,7 +6,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/linux/ipc_fd.h"
+#include "base/unique_fd.h"
 
 namespace brisvale::ipc {
 

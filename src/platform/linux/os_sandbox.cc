@@ -1,4 +1,5 @@
 #include "platform/linux/os_sandbox.h"
+#include "base/unique_fd.h"
 
 #include <dirent.h>
 #include <fcntl.h>
@@ -28,29 +29,7 @@
 namespace brisvale::linux_os {
 namespace {
 
-class Fd {
- public:
-  explicit Fd(int fd = -1) : fd_(fd) {}
-  Fd(Fd&& other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
-  Fd& operator=(Fd&& other) noexcept {
-    if (this != &other) {
-      if (fd_ >= 0) ::close(fd_);
-      fd_ = std::exchange(other.fd_, -1);
-    }
-    return *this;
-  }
-  ~Fd() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  Fd(const Fd&) = delete;
-  Fd& operator=(const Fd&) = delete;
-  int get() const { return fd_; }
-  int release() { return std::exchange(fd_, -1); }
-  explicit operator bool() const { return fd_ >= 0; }
-
- private:
-  int fd_;
-};
+using Fd = UniqueFd;
 
 struct DirCloser {
   void operator()(DIR* dir) const { ::closedir(dir); }

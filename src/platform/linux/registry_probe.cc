@@ -1,4 +1,5 @@
 #include "platform/linux/registry_probe.h"
+#include "base/unique_fd.h"
 
 #include <blkid/blkid.h>
 #include <fcntl.h>
@@ -23,19 +24,7 @@ struct ProbeDeleter {
   void operator()(blkid_probe probe) const { blkid_free_probe(probe); }
 };
 
-class Fd {
- public:
-  explicit Fd(int fd) : fd_(fd) {}
-  ~Fd() {
-    if (fd_ >= 0) close(fd_);
-  }
-  Fd(const Fd&) = delete;
-  Fd& operator=(const Fd&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
+using Fd = UniqueFd;
 
 }  // namespace
 

@@ -1,11 +1,11 @@
-// An owned file descriptor for the transport's sockets, pidfds and listeners.
+// An owned file descriptor: closed when its owner goes, on every path.
 #pragma once
 
 #include <unistd.h>
 
 #include <utility>
 
-namespace brisvale::ipc {
+namespace brisvale {
 
 class UniqueFd {
  public:
@@ -22,6 +22,8 @@ class UniqueFd {
 
   int get() const { return fd_; }
   explicit operator bool() const { return fd_ >= 0; }
+  // Gives up ownership without closing.
+  int release() { return std::exchange(fd_, -1); }
   void Reset(int fd = -1) {
     if (fd_ >= 0) ::close(fd_);
     fd_ = fd;
@@ -31,4 +33,4 @@ class UniqueFd {
   int fd_ = -1;
 };
 
-}  // namespace brisvale::ipc
+}  // namespace brisvale
