@@ -79,7 +79,6 @@ struct Arg {
   std::variant<int64_t, uint64_t, double, const char*, const plist::Value*, std::string_view,
                const void*>
       value;
-  std::optional<plist::Value> owned;  // keeps a temporary Value alive for %@
 
   Arg(int v) : value(static_cast<int64_t>(v)) {}
   Arg(long v) : value(static_cast<int64_t>(v)) {}
