@@ -9,6 +9,8 @@
 #include <functional>
 #include <span>
 
+#include "platform/os.h"
+
 namespace brisvale {
 
 // Stable codes: callers compare against the numbers.
@@ -25,20 +27,13 @@ enum FsType : uint32_t {
 // "MSDOS EXFAT", "MSDOS_NTFS". A code outside the table prints as "Unknown".
 const char* FsTypeLabel(FsType type);
 
-inline constexpr size_t kVolumeHeaderLength = 4096;
-using VolumeHeaderSpan = std::span<uint8_t, kVolumeHeaderLength>;
-
-// How reading a device node's volume header went. `error` is the error number current
-// right after the failing call (a short read leaves whatever was there before).
-struct VolumeHeaderRead {
-  enum class Outcome { Read, OpenFailed, ReadFailed };
-  Outcome outcome = Outcome::Read;
-  int error = 0;
-};
+using os::kVolumeHeaderLength;
+using os::VolumeHeaderRead;
+using os::VolumeHeaderSpan;
 
 // Opens `devicePath` read-only, fills `header` from offset 0 with one read call of
 // kVolumeHeaderLength bytes, and closes the node on every path. Anything but a full
-// read is ReadFailed. The real one lives with the OS layer; tests pass their own.
+// read is ReadFailed. The daemon passes its os::Os; tests pass their own.
 using VolumeHeaderReader = std::function<VolumeHeaderRead(const char* devicePath, VolumeHeaderSpan header)>;
 
 // The code for a complete volume header; never fails.

@@ -1,6 +1,6 @@
 // The platform services of this process, set once at start-up by the entry point
 // (tests install fakes with ScopedServices). Handlers reach the registry, the
-// operating system and the transport through here, so their signatures stay those of
+// operating system, the transport and the notification centre through here, so their signatures stay those of
 // the request protocol.
 #pragma once
 
@@ -14,11 +14,15 @@ class Os;
 namespace ipc {
 class IpcService;
 }
+namespace notify {
+class SystemNotify;
+}
 
 struct Services {
   registry::DeviceRegistry* registry = nullptr;
   os::Os* os = nullptr;
   ipc::IpcService* ipc = nullptr;
+  notify::SystemNotify* notify = nullptr;
 };
 
 inline Services& CurrentServices() {

@@ -10,7 +10,22 @@ namespace brisvale::os {
 
 class LinuxOs final : public Os {
  public:
+  // os_mounts.cc
   int GetMountTable(std::span<MountRecord> records) override;
+  // os_volume_header.cc
+  VolumeHeaderRead ReadVolumeHeader(const char* devicePath, VolumeHeaderSpan header) override;
+  // os_unmount.cc
+  int Unmount(const char* path, bool force) override;
+  int RemoveDirectory(const char* path) override;
+  int Unlink(const char* path) override;
+  int SyncFilesystem(const char* path) override;
+  int OpenDevice(const char* devicePath) override;
+  int EjectDevice(int fd) override;
+  // os_tree.cc
+  int ReadDirectory(const char* path, std::vector<DirectoryEntry>& entries) override;
+  int RealPath(const char* path, std::string& resolved) override;
+  int ClearFlags(const char* path) override;
+  TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) override;
 };
 
 // GetMountTable over a table in the kernel's mountinfo format at `path`.

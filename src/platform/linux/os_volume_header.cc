@@ -1,36 +1,18 @@
-#include "platform/linux/os_volume_header.h"
-
+// The device read behind file-system identification: one open, one read of the volume
+// header from offset 0, one close, with plain POSIX calls.
 #include <fcntl.h>
 #include <unistd.h>
 
 #include <cerrno>
 
+#include "base/unique_fd.h"
+#include "platform/linux/os_system.h"
+
 namespace brisvale::os {
-namespace {
 
-class Descriptor {
- public:
-  explicit Descriptor(int fd) : fd_(fd) {}
-  ~Descriptor() {
-    if (fd_ >= 0) {
-      const int saved = errno;
-      ::close(fd_);
-      errno = saved;
-    }
-  }
-  Descriptor(const Descriptor&) = delete;
-  Descriptor& operator=(const Descriptor&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
-
-}  // namespace
-
-VolumeHeaderRead ReadVolumeHeader(const char* devicePath, VolumeHeaderSpan header) {
-  const Descriptor fd(::open(devicePath, O_RDONLY));
-  if (fd.get() < 0) return {VolumeHeaderRead::Outcome::OpenFailed, errno};
+VolumeHeaderRead LinuxOs::ReadVolumeHeader(const char* devicePath, VolumeHeaderSpan header) {
+  const UniqueFd fd(::open(devicePath, O_RDONLY | O_CLOEXEC));
+  if (!fd) return {VolumeHeaderRead::Outcome::OpenFailed, errno};
   // One call and no retry: a short read means the node is not a whole medium. A short
   // read sets no error number, so clear it to report 0 rather than a stale one.
   errno = 0;

@@ -8,7 +8,7 @@
 #include <fstream>
 
 #include "base/log.h"
-#include "platform/linux/os_volume_header.h"
+#include "platform/linux/os_system.h"
 
 namespace brisvale {
 namespace {
@@ -88,11 +88,15 @@ TEST(IdentifyFilesystem, RealNodesNeedAWholeHeader) {
   std::ofstream(shortNode, std::ios::binary) << bytes.substr(0, kVolumeHeaderLength - 1);
 
   log::CaptureSink capture;
-  EXPECT_EQ(IdentifyFilesystem(whole.c_str(), os::ReadVolumeHeader), FsTypeNTFS);
-  EXPECT_EQ(IdentifyFilesystem(shortNode.c_str(), os::ReadVolumeHeader), FsTypeUnknown);
-  EXPECT_EQ(IdentifyFilesystem(dir, os::ReadVolumeHeader), FsTypeUnknown);
+  os::LinuxOs linuxOs;
+  const VolumeHeaderReader readHeader = [&](const char* path, VolumeHeaderSpan header) {
+    return linuxOs.ReadVolumeHeader(path, header);
+  };
+  EXPECT_EQ(IdentifyFilesystem(whole.c_str(), readHeader), FsTypeNTFS);
+  EXPECT_EQ(IdentifyFilesystem(shortNode.c_str(), readHeader), FsTypeUnknown);
+  EXPECT_EQ(IdentifyFilesystem(dir, readHeader), FsTypeUnknown);
   ::unlink(whole.c_str()), ::unlink(shortNode.c_str()), ::rmdir(dir);
-  EXPECT_EQ(IdentifyFilesystem(whole.c_str(), os::ReadVolumeHeader), FsTypeUnknown);
+  EXPECT_EQ(IdentifyFilesystem(whole.c_str(), readHeader), FsTypeUnknown);
   const std::vector<std::string> expected = {
       "Failed to read " + shortNode + " volume header: 0",  // a short read sets no error
       "Failed to read " + std::string(dir) + " volume header: 21",
