@@ -5,7 +5,6 @@
 
 namespace brisvale {
 
-void HandleCopyDevices(const plist::Value&, plist::Dictionary&) {}
 void HandleMountRequest(MatchingContext&, const plist::Value&, plist::Dictionary&) {}
 void HandleUnmount(const plist::Value&, plist::Dictionary&) {}
 void HandleSync(const plist::Value&, plist::Dictionary&) {}

@@ -5,10 +5,10 @@
 
 #include "base/plist.h"
 #include "daemon/matching_context.h"
+#include "inventory/inventory.h"
 
 namespace brisvale {
 
-void HandleCopyDevices(const plist::Value& request, plist::Dictionary& reply);
 void HandleMountRequest(MatchingContext& context, const plist::Value& request,
                         plist::Dictionary& reply);
 void HandleUnmount(const plist::Value& request, plist::Dictionary& reply);
