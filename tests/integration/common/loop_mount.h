@@ -1,0 +1,39 @@
+// A real file system for integration tests: an ext4 image built without root, attached
+// to a loop device and mounted, all released in the destructor, also when a test fails.
+#pragma once
+
+#include <memory>
+#include <string>
+
+namespace brisvale::testing {
+
+// Builds a `sizeMiB` ext4 image at `imagePath` (holding a copy of `contentDir` when not
+// empty). false with a message in `error` when mkfs fails.
+bool MakeExt4Image(const std::string& imagePath, int sizeMiB, const std::string& contentDir,
+                   std::string* error);
+
+class LoopMount {
+ public:
+  // Attaches `imagePath` to a free loop device (read-only when asked), creates the
+  // device node under `devRoot` when it lacks one, and mounts the device at
+  // `mountPoint`, which must exist. nullptr with a message in `error` on failure.
+  static std::unique_ptr<LoopMount> Create(const std::string& imagePath, const std::string& mountPoint,
+                                           const std::string& devRoot, bool readOnly,
+                                           std::string* error);
+  ~LoopMount();
+  LoopMount(const LoopMount&) = delete;
+  LoopMount& operator=(const LoopMount&) = delete;
+
+  // "/dev/loopN", as the mount table and the daemon name it.
+  const std::string& device() const { return device_; }
+  const std::string& mountPoint() const { return mountPoint_; }
+
+ private:
+  LoopMount() = default;
+  std::string device_;
+  std::string mountPoint_;
+  std::string nodeCreated_;  // the node made under the device root, removed again
+  int loopFd_ = -1;
+};
+
+}  // namespace brisvale::testing
