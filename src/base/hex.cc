@@ -6,6 +6,8 @@
 #include <iterator>
 #include <new>
 
+#include "base/utf8.h"
+
 namespace brisvale::BrisvaleMounter {
 namespace {
 
@@ -27,37 +29,6 @@ constexpr bool RangesAreSortedAndDisjoint() {
 }
 static_assert(RangesAreSortedAndDisjoint(), "the range table must be sorted for binary search");
 
-// Decodes one UTF-8 sequence at the front of `text`, advancing past it. Rejects
-// truncated and overlong sequences, surrogates and values above U+10FFFF.
-std::optional<char32_t> DecodeUtf8(std::string_view& text) {
-  const auto byte = [&](size_t i) { return static_cast<uint8_t>(text[i]); };
-  const uint8_t lead = byte(0);
-  size_t length;
-  char32_t value;
-  char32_t minimum;
-  if (lead < 0x80) {
-    text.remove_prefix(1);
-    return lead;
-  } else if (lead >= 0xC2 && lead <= 0xDF) {
-    length = 2, value = lead & 0x1F, minimum = 0x80;
-  } else if (lead >= 0xE0 && lead <= 0xEF) {
-    length = 3, value = lead & 0x0F, minimum = 0x800;
-  } else if (lead >= 0xF0 && lead <= 0xF4) {
-    length = 4, value = lead & 0x07, minimum = 0x10000;
-  } else {
-    return std::nullopt;
-  }
-  if (text.size() < length) return std::nullopt;
-  for (size_t i = 1; i < length; ++i) {
-    if ((byte(i) & 0xC0) != 0x80) return std::nullopt;
-    value = (value << 6) | (byte(i) & 0x3F);
-  }
-  if (value < minimum || value > 0x10FFFF || (value >= 0xD800 && value <= 0xDFFF)) {
-    return std::nullopt;
-  }
-  text.remove_prefix(length);
-  return value;
-}
 
 // General category letter (L*), mark (M*) or number (N*).
 bool IsLetterMarkOrNumber(char32_t codePoint) {
@@ -75,8 +46,8 @@ bool IsLetterMarkOrNumber(char32_t codePoint) {
 std::optional<std::u16string> AlphanumericUtf16(std::string_view text) {
   std::u16string units;
   units.reserve(text.size());
-  while (!text.empty()) {
-    const std::optional<char32_t> codePoint = DecodeUtf8(text);
+  for (size_t pos = 0; pos < text.size();) {
+    const std::optional<char32_t> codePoint = utf8::Decode(text, pos);
     if (!codePoint || !IsLetterMarkOrNumber(*codePoint)) return std::nullopt;
     if (*codePoint < 0x10000) {
       units.push_back(static_cast<char16_t>(*codePoint));

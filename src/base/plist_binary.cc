@@ -9,6 +9,7 @@
 
 #include "base/plist.h"
 #include "base/plist_internal.h"
+#include "base/utf8.h"
 
 namespace brisvale::plist {
 namespace {
@@ -284,7 +285,7 @@ class BinaryReader {
         unit = 0x10000 + ((unit - 0xD800) << 10) + (low - 0xDC00);
         ++i;
       }
-      internal::AppendUtf8(text, unit);
+      utf8::Append(text, unit);
     }
     return true;
   }
@@ -440,7 +441,7 @@ class BinaryWriter {
     std::vector<uint16_t> units;
     units.reserve(text.size());
     for (size_t pos = 0; pos < text.size();) {
-      std::optional<char32_t> cp = internal::DecodeUtf8(text, pos);
+      std::optional<char32_t> cp = utf8::Decode(text, pos);
       if (!cp) {
         // Text is UTF-8 by contract; a stray byte becomes the replacement character.
         cp = 0xFFFD;

@@ -17,9 +17,4 @@ std::string FormatIsoDate(Date date);
 // The exact form FormatIsoDate writes, with calendar-valid fields.
 std::optional<Date> ParseIsoDate(std::string_view text);
 
-// Decodes one UTF-8 sequence at text[pos]; returns the code point and advances pos,
-// or returns none (pos unchanged) for an invalid, overlong or surrogate sequence.
-std::optional<char32_t> DecodeUtf8(std::string_view text, size_t& pos);
-void AppendUtf8(std::string& out, char32_t codePoint);
-
 }  // namespace brisvale::plist::internal

@@ -9,6 +9,7 @@
 
 #include "base/plist.h"
 #include "base/plist_internal.h"
+#include "base/utf8.h"
 
 namespace brisvale::plist {
 namespace {
@@ -322,16 +323,16 @@ void AppendEscaped(std::string& out, std::string_view text) {
       default: break;
     }
     const size_t start = pos;
-    std::optional<char32_t> cp = internal::DecodeUtf8(text, pos);
+    std::optional<char32_t> cp = utf8::Decode(text, pos);
     // XML 1.0 cannot carry control characters, U+FFFE/U+FFFF or broken UTF-8 at all;
     // they become the replacement character rather than making the document unreadable.
     // (Two keys that differ only in such characters then collide, and the reader
     // refuses the duplicate.)
     if (!cp) {
       ++pos;
-      internal::AppendUtf8(out, 0xFFFD);
+      utf8::Append(out, 0xFFFD);
     } else if (*cp < 0x20 || *cp == 0xFFFE || *cp == 0xFFFF) {
-      internal::AppendUtf8(out, 0xFFFD);
+      utf8::Append(out, 0xFFFD);
     } else {
       out.append(text.substr(start, pos - start));
     }
