@@ -8,7 +8,7 @@
 #include "daemon/dispatcher.h"
 #include "platform/linux/ipc_frame.h"
 #include "platform/linux/ipc_message.h"
-#include "platform/os.h"
+#include "fake_os.h"
 #include "platform/services.h"
 #include "registry/registry_model.h"
 
@@ -19,11 +19,6 @@ using namespace brisvale;
 class NullSink : public log::Sink {
  public:
   void Write(log::Level, std::string_view) override {}
-};
-
-class RefusingOs : public os::Os {
- public:
-  int GetMountTable(std::span<os::MountRecord>) override { return 0; }
 };
 
 class RecordingConnection : public ipc::Connection {
@@ -51,7 +46,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   (void)initialised;
 
   static registry::RegistryModel registry;
-  static RefusingOs os;
+  static testing::FakeOs os;  // an empty mount table; every other call refused
   ScopedServices services(Services{&registry, &os, nullptr});
 
   ipc::FrameReader reader;

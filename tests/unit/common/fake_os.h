@@ -1,0 +1,49 @@
+// An operating system for unit tests: a mount table and volume headers set by the test,
+// every other call answering ENOSYS unless the test overrides it.
+#pragma once
+
+#include <cerrno>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "platform/os.h"
+
+namespace brisvale::testing {
+
+class FakeOs : public os::Os {
+ public:
+  std::vector<os::MountRecord> mounts;
+  int mountTableError = 0;  // -errno answered by GetMountTable when set
+  // Volume headers by device path; a path not listed fails to open with ENOENT.
+  std::map<std::string, std::vector<uint8_t>, std::less<>> volumeHeaders;
+
+  int GetMountTable(std::span<os::MountRecord> records) override {
+    if (mountTableError) return mountTableError;
+    if (records.empty()) return static_cast<int>(mounts.size());
+    const size_t count = std::min(records.size(), mounts.size());
+    std::copy_n(mounts.begin(), count, records.begin());
+    return static_cast<int>(count);
+  }
+  os::VolumeHeaderRead ReadVolumeHeader(const char* devicePath, os::VolumeHeaderSpan header) override {
+    const auto found = volumeHeaders.find(devicePath);
+    if (found == volumeHeaders.end()) return {os::VolumeHeaderRead::Outcome::OpenFailed, ENOENT};
+    std::fill(header.begin(), header.end(), 0);
+    std::copy_n(found->second.begin(), std::min(found->second.size(), header.size()), header.begin());
+    return {};
+  }
+  int Unmount(const char*, bool) override { return -ENOSYS; }
+  int RemoveDirectory(const char*) override { return -ENOSYS; }
+  int Unlink(const char*) override { return -ENOSYS; }
+  int SyncFilesystem(const char*) override { return -ENOSYS; }
+  int OpenDevice(const char*) override { return -ENOSYS; }
+  int EjectDevice(int) override { return -ENOSYS; }
+  int ReadDirectory(const char*, std::vector<os::DirectoryEntry>&) override { return -ENOSYS; }
+  int RealPath(const char*, std::string&) override { return -ENOSYS; }
+  int ClearFlags(const char*) override { return -ENOSYS; }
+  os::TreeWalk WalkTree(const char*, const std::function<bool(const os::TreeNode&)>&) override {
+    return {-ENOSYS, 0};
+  }
+};
+
+}  // namespace brisvale::testing
