@@ -5,6 +5,7 @@
 
 #include "base/log.h"
 #include "fake_os.h"
+#include "plist_printers.h"
 #include "platform/services.h"
 #include "registry/registry_model.h"
 
