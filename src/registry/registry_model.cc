@@ -262,6 +262,7 @@ ObjectRef RegistryModel::Publish(const ObjectRef& parent, std::string_view class
   node->parent = parentNode;
   if (parentNode) parentNode->children.push_back(node);
   nodes_.emplace(node->id, node);
+  IndexName(*node, true);
   Offer(node, LiveWatches(), nullptr);
   return node;
 }
@@ -273,7 +274,9 @@ bool RegistryModel::SetProperties(const ObjectRef& object, plist::Dictionary pro
   std::vector<bool> before;
   before.reserve(watches.size());
   for (const auto& watch : watches) before.push_back(Matches(watch->matching, *node));
+  IndexName(*node, false);
   node->properties = plist::Value(std::move(properties));
+  IndexName(*node, true);
   Offer(node, watches, &before);
   return true;
 }
@@ -308,6 +311,7 @@ void RegistryModel::Terminate(const ObjectRef& object) {
 void RegistryModel::TerminateOne(const std::shared_ptr<Node>& node) {
   node->terminated = true;
   node->userClients = nullptr;
+  IndexName(*node, false);
   nodes_.erase(node->id);
   if (node->parent) {
     std::erase_if(node->parent->children, [&](const std::weak_ptr<Node>& weak) {
@@ -345,19 +349,65 @@ void RegistryModel::AddProvider(Provider* provider) { providers_.push_back(provi
 
 void RegistryModel::RemoveProvider(Provider* provider) { std::erase(providers_, provider); }
 
+namespace {
+
+// Matches() without copying property values, properties first: in a registry of many
+// media a lookup by "BSD Name" is decided by one short string comparison per object.
+bool NodeMatches(const Matching& matching, const plist::Value& properties,
+                 const std::vector<std::string>& chain) {
+  for (const auto& [key, wanted] : matching.properties) {
+    const plist::Value* value = properties.get(key);
+    if (!value || !(*value == wanted)) return false;
+  }
+  return std::find(chain.begin(), chain.end(), matching.className) != chain.end();
+}
+
+}  // namespace
+
+void RegistryModel::IndexName(const Node& node, bool add) {
+  const std::string* name = node.properties.getString(kBsdNameKey);
+  if (!name) return;
+  if (add) {
+    bsdNames_[*name].insert(node.id);
+  } else if (auto found = bsdNames_.find(*name); found != bsdNames_.end()) {
+    found->second.erase(node.id);
+    if (found->second.empty()) bsdNames_.erase(found);
+  }
+}
+
+void RegistryModel::ForEachCandidate(const Matching& matching,
+                                     const std::function<bool(const std::shared_ptr<Node>&)>& visit) const {
+  // Looking media up by kernel name is what every listing does for every mount; the
+  // index keeps that from scanning the whole registry.
+  if (const plist::Value* name = matching.properties.find(kBsdNameKey); name && name->string()) {
+    const auto ids = bsdNames_.find(*name->string());
+    if (ids == bsdNames_.end()) return;
+    for (uint64_t id : ids->second) {
+      if (!visit(nodes_.at(id))) return;
+    }
+    return;
+  }
+  for (const auto& [id, node] : nodes_) {
+    if (!visit(node)) return;
+  }
+}
+
 Result<std::unique_ptr<Iterator>> RegistryModel::GetMatchingServices(const Matching& matching) {
   std::vector<ObjectRef> found;
-  for (const auto& [id, node] : nodes_) {
-    if (Matches(matching, *node)) found.push_back(node);
-  }
+  ForEachCandidate(matching, [&](const std::shared_ptr<Node>& node) {
+    if (NodeMatches(matching, node->properties, node->chain)) found.push_back(node);
+    return true;
+  });
   return {kSuccess, std::make_unique<SnapshotIterator>(std::move(found))};
 }
 
 ObjectRef RegistryModel::GetMatchingService(const Matching& matching) {
-  for (const auto& [id, node] : nodes_) {
-    if (Matches(matching, *node)) return node;
-  }
-  return nullptr;
+  ObjectRef found;
+  ForEachCandidate(matching, [&](const std::shared_ptr<Node>& node) {
+    if (NodeMatches(matching, node->properties, node->chain)) found = node;
+    return !found;
+  });
+  return found;
 }
 
 Result<std::unique_ptr<NotificationPort>> RegistryModel::CreateNotificationPort() {

@@ -8,6 +8,7 @@
 #include <functional>
 #include <map>
 #include <memory>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -89,6 +90,11 @@ class RegistryModel final : public DeviceRegistry {
              const std::vector<bool>* matchedBefore);
   std::vector<std::shared_ptr<MatchWatch>> LiveWatches();
   void TerminateOne(const std::shared_ptr<Node>& node);
+  // Keeps bsdNames_ in step with a node's "BSD Name".
+  void IndexName(const Node& node, bool add);
+  // The nodes a matching can hold, in publication order; `visit` answers false to stop.
+  void ForEachCandidate(const Matching& matching,
+                        const std::function<bool(const std::shared_ptr<Node>&)>& visit) const;
 
   std::map<std::string, std::string, std::less<>> superclass_;
   std::map<uint64_t, std::shared_ptr<Node>> nodes_;  // live objects, in publication order
@@ -96,6 +102,8 @@ class RegistryModel final : public DeviceRegistry {
   std::vector<std::weak_ptr<MatchWatch>> matchWatches_;
   std::multimap<uint64_t, std::weak_ptr<InterestWatch>> interestWatches_;
   std::vector<Provider*> providers_;
+  static constexpr std::string_view kBsdNameKey = "BSD Name";
+  std::map<std::string, std::set<uint64_t>, std::less<>> bsdNames_;  // live objects by name
 };
 
 }  // namespace brisvale::registry
