@@ -1,7 +1,14 @@
 #include <libmount/libmount.h>
 
+#include <fcntl.h>
+#include <poll.h>
+#include <unistd.h>
+
+#include <algorithm>
 #include <cerrno>
+#include <cstdio>
 #include <memory>
+#include <vector>
 
 #include "platform/linux/os_system.h"
 
@@ -23,21 +30,21 @@ bool HasOption(const char* options, const char* name) {
 
 std::string Text(const char* text) { return text ? std::string(text) : std::string(); }
 
-}  // namespace
+struct FileCloser {
+  void operator()(FILE* stream) const { std::fclose(stream); }
+};
 
-int ReadMountTable(const char* path, std::span<MountRecord> records) {
+// Parses a table in the kernel's mountinfo format from `stream`.
+int ParseMountTable(FILE* stream, std::vector<MountRecord>& records) {
   std::unique_ptr<libmnt_table, TableDeleter> table(mnt_new_table());
   std::unique_ptr<libmnt_iter, IterDeleter> iter(mnt_new_iter(MNT_ITER_FORWARD));
   if (!table || !iter) return -ENOMEM;
   // The parser decodes the table's octal escapes (a space is written \040).
-  if (int rc = mnt_table_parse_file(table.get(), path); rc != 0) return rc < 0 ? rc : -EINVAL;
-  if (records.empty()) return mnt_table_get_nents(table.get());
-
-  size_t filled = 0;
+  if (int rc = mnt_table_parse_stream(table.get(), stream, "mountinfo"); rc != 0) return rc < 0 ? rc : -EINVAL;
+  records.clear();
   libmnt_fs* fs = nullptr;
-  while (filled < records.size() && mnt_table_next_fs(table.get(), iter.get(), &fs) == 0) {
-    MountRecord& record = records[filled++];
-    record.flags = 0;
+  while (mnt_table_next_fs(table.get(), iter.get(), &fs) == 0) {
+    MountRecord record;
     // Read-only either for this mount or for the whole file system.
     if (HasOption(mnt_fs_get_vfs_options(fs), "ro") || HasOption(mnt_fs_get_fs_options(fs), "ro")) {
       record.flags |= kMountReadOnly;
@@ -45,12 +52,55 @@ int ReadMountTable(const char* path, std::span<MountRecord> records) {
     record.typeName = Text(mnt_fs_get_fstype(fs));
     record.mountedOn = Text(mnt_fs_get_target(fs));
     record.mountedFrom = Text(mnt_fs_get_source(fs));
+    records.push_back(std::move(record));
   }
+  return static_cast<int>(records.size());
+}
+
+int CountOrFill(const std::vector<MountRecord>& table, std::span<MountRecord> records) {
+  if (records.empty()) return static_cast<int>(table.size());
+  const size_t filled = std::min(records.size(), table.size());
+  std::copy_n(table.begin(), filled, records.begin());
   return static_cast<int>(filled);
 }
 
+}  // namespace
+
+int ReadMountTable(const char* path, std::span<MountRecord> records) {
+  std::unique_ptr<FILE, FileCloser> stream(std::fopen(path, "re"));
+  if (!stream) return -errno;
+  std::vector<MountRecord> table;
+  if (int rc = ParseMountTable(stream.get(), table); rc < 0) return rc;
+  return CountOrFill(table, records);
+}
+
+// The count and the fill of one listing come a moment apart. The kernel flags the
+// mountinfo descriptor when the table changes (POLLPRI), so the fill reuses the table
+// the count parsed unless a mount or unmount came in between; the table is read and
+// parsed once per listing instead of twice.
 int LinuxOs::GetMountTable(std::span<MountRecord> records) {
-  return ReadMountTable("/proc/self/mountinfo", records);
+  if (!mountInfo_) {
+    mountInfo_.Reset(::open("/proc/self/mountinfo", O_RDONLY | O_CLOEXEC));
+    if (!mountInfo_) return -errno;
+  }
+  pollfd changed{mountInfo_.get(), POLLPRI, 0};
+  const bool tableChanged = ::poll(&changed, 1, 0) != 0;  // an error counts as a change
+  const bool reuse = !records.empty() && countedTable_ && !tableChanged;
+  if (!reuse) {
+    if (::lseek(mountInfo_.get(), 0, SEEK_SET) < 0) return -errno;
+    // The descriptor stays ours: the stream reads through a duplicate.
+    const int duplicate = ::dup(mountInfo_.get());
+    if (duplicate < 0) return -errno;
+    std::unique_ptr<FILE, FileCloser> stream(::fdopen(duplicate, "r"));
+    if (!stream) {
+      ::close(duplicate);
+      return -ENOMEM;
+    }
+    if (int rc = ParseMountTable(stream.get(), table_); rc < 0) return rc;
+  }
+  // Only a count is remembered for the fill that follows it.
+  countedTable_ = records.empty();
+  return CountOrFill(table_, records);
 }
 
 }  // namespace brisvale::os

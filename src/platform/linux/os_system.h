@@ -3,7 +3,9 @@
 #pragma once
 
 #include <span>
+#include <vector>
 
+#include "base/unique_fd.h"
 #include "platform/os.h"
 
 namespace brisvale::os {
@@ -26,6 +28,11 @@ class LinuxOs final : public Os {
   int RealPath(const char* path, std::string& resolved) override;
   int ClearFlags(const char* path) override;
   TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) override;
+
+ private:
+  UniqueFd mountInfo_;               // /proc/self/mountinfo, opened on first use
+  std::vector<MountRecord> table_;   // the last table parsed
+  bool countedTable_ = false;        // table_ was parsed for a count
 };
 
 // GetMountTable over a table in the kernel's mountinfo format at `path`.

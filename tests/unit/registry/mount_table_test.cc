@@ -1,4 +1,5 @@
 #include <gtest/gtest.h>
+#include <sys/mount.h>
 #include <unistd.h>
 
 #include <fstream>
@@ -35,6 +36,23 @@ TEST(MountTable, CountThenFillDecodesPathsAndReadsTheReadOnlyFlag) {
   EXPECT_EQ(two[1].mountedOn, "/private/var/mnt/my stick");
   unlink(name);
   EXPECT_LT(ReadMountTable(name, {}), 0);
+}
+
+// The fill reuses the count's table only while the kernel reports no change.
+TEST(MountTable, FillSeesAMountMadeAfterTheCount) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to mount";
+  char dir[] = "/tmp/brisvale-mount-XXXXXX";
+  ASSERT_NE(mkdtemp(dir), nullptr);
+  LinuxOs os;
+  const int counted = os.GetMountTable({});
+  ASSERT_GT(counted, 0);
+  ASSERT_EQ(mount("tmpfs", dir, "tmpfs", 0, nullptr), 0);
+  std::vector<MountRecord> records(counted + 1);
+  const int filled = os.GetMountTable(records);
+  umount2(dir, MNT_DETACH);
+  rmdir(dir);
+  ASSERT_EQ(filled, counted + 1);
+  EXPECT_EQ(records[filled - 1].mountedOn, dir);
 }
 
 }  // namespace
