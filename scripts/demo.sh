@@ -26,13 +26,49 @@ trap cleanup EXIT
 
 step() { printf '\n\033[1m$ %s\033[0m\n' "$*"; "$@" || true; }
 
+# Simulated hardware: a USB stick with one FAT partition, and a camera.
+cat >"$sandbox/devices.plist" <<'PLIST'
+<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><dict><key>Objects</key><array>
+  <dict><key>Name</key><string>stick</string><key>Class</key><string>KxUSBHostDevice</string>
+    <key>Properties</key><dict><key>removable</key><true/></dict>
+    <key>Children</key><array>
+      <dict><key>Name</key><string>data</string><key>Class</key><string>KxMedia</string>
+        <key>Properties</key><dict>
+          <key>BSD Name</key><string>sdz1</string><key>Content</key><string>0x0C</string>
+          <key>Removable</key><true/><key>Leaf</key><true/><key>Writable</key><true/>
+        </dict></dict>
+    </array></dict>
+  <dict><key>Name</key><string>camera</string><key>Class</key><string>KxUSBHostDevice</string>
+    <key>Children</key><array>
+      <dict><key>Name</key><string>ptp</string><key>Class</key><string>KxUSBHostInterface</string>
+        <key>Properties</key><dict>
+          <key>bInterfaceClass</key><integer>6</integer><key>bInterfaceSubClass</key><integer>1</integer>
+          <key>bInterfaceProtocol</key><integer>1</integer><key>locationID</key><integer>17825792</integer>
+        </dict></dict>
+    </array></dict>
+</array></dict></plist>
+PLIST
+
 echo "Sandbox root: $sandbox"
-"$daemon" --root "$sandbox" --verbose >"$log" 2>&1 &
+"$daemon" --root "$sandbox" --devices /devices.plist --verbose >"$log" 2>&1 &
 daemon_pid=$!
 for _ in $(seq 100); do
   [[ -S "$sandbox/private/var/run/vexa/com.vantrel.brisvale_mounter.vexa" ]] && break
   sleep 0.05
 done
+
+# The stick's node holds a FAT boot sector; it is listed, never mounted.
+{ printf '\xeb\x3c\x90MSDOS5.0'; head -c 4096 /dev/zero; } >"$sandbox/dev/sdz1"
+
+# A developer image on a loop device at /Developer; the two directories above the
+# image file hold the halves of its signature's hex text.
+image_dir="$sandbox/private/var/run/images/AB12CD/34EF56"
+mkdir -p "$image_dir" "$sandbox/Developer"
+mkfs.ext4 -q -O ^has_journal "$image_dir/image.img" 4M
+loop=$(losetup --find --show --read-only "$image_dir/image.img")
+[[ -e "$sandbox$loop" ]] || mknod "$sandbox$loop" b 7 "${loop#/dev/loop}"
+mount -o ro "$loop" "$sandbox/Developer"
 
 step "$ctl" --root "$sandbox" list
 step "$ctl" --root "$sandbox" list --json

@@ -91,6 +91,14 @@ bool Succeeded(const plist::Value& reply) {
 
 std::string Cell(const plist::Value& entry, const char* key) {
   const plist::Value* value = entry.get(key);
+  // A camera has no node; its USB location names it.
+  if (!value && std::string_view(key) == "DeviceNode" && entry.get("LocationID")) {
+    if (std::optional<plist::Integer> location = entry.get("LocationID")->integer()) {
+      char name[32];
+      std::snprintf(name, sizeof name, "usb@0x%08llx", static_cast<unsigned long long>(location->asUnsigned()));
+      return name;
+    }
+  }
   if (!value) return "-";
   if (std::optional<bool> flag = value->boolean()) return *flag ? "yes" : "no";
   return value->description();
@@ -106,6 +114,7 @@ void PrintTable(const plist::Array& entries) {
     for (const char* column : columns) row.push_back(Cell(entry, column));
     rows.push_back(std::move(row));
   }
+  std::sort(rows.begin() + 1, rows.end());  // the listing comes in no defined order
   std::vector<size_t> widths(std::size(columns), 0);
   for (const auto& row : rows) {
     for (size_t i = 0; i < row.size(); ++i) widths[i] = std::max(widths[i], row[i].size());
