@@ -17,8 +17,9 @@ using ::testing::IsEmpty;
 using ::testing::UnorderedElementsAre;
 
 std::vector<uint8_t> BootSector(std::string_view oemName) {
-  std::vector<uint8_t> header = {0xEB, 0x3C, 0x90};
-  header.insert(header.end(), oemName.begin(), oemName.end());
+  std::vector<uint8_t> header(3 + oemName.size());
+  header[0] = 0xEB, header[1] = 0x3C, header[2] = 0x90;
+  std::copy(oemName.begin(), oemName.end(), header.begin() + 3);
   return header;
 }
 
