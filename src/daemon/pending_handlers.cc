@@ -6,8 +6,6 @@
 namespace brisvale {
 
 void HandleMountRequest(MatchingContext&, const plist::Value&, plist::Dictionary&) {}
-void HandleUnmount(const plist::Value&, plist::Dictionary&) {}
-void HandleSync(const plist::Value&, plist::Dictionary&) {}
 
 void SubscribeMediaAttach(MatchingContext&) {}
 void SubscribeCameraAttach(MatchingContext&) {}
