@@ -1,9 +1,87 @@
 #include "daemon/stale_mount_points.h"
 
-namespace brisvale {
+#include <cerrno>
+#include <string>
+#include <vector>
 
-// The tree removal arrives with the unmount work; until then start-up leaves the
-// roots as they are.
-void RemoveStaleMountPoints(const char*) {}
+#include "base/log.h"
+#include "inventory/inventory.h"
+#include "platform/os.h"
+#include "platform/services.h"
+
+namespace brisvale {
+namespace {
+
+using log::Level;
+using log::Log;
+
+constexpr size_t kPathBufferSize = 1024;
+
+}  // namespace
+
+int RemoveTree(const char* path, int removeStart) {
+  os::Os& os = *CurrentServices().os;
+  const std::string start = std::string(path).substr(0, kPathBufferSize);
+  int result = 0;
+  const os::TreeWalk walk = os.WalkTree(start.c_str(), [&](const os::TreeNode& node) {
+    using Kind = os::TreeNode::Kind;
+    if (node.kind == Kind::NonDirectory) {
+      os.ClearFlags(node.path.c_str());
+      if (const int rc = os.Unlink(node.path.c_str()); rc < 0) {
+        Log(Level::Default, "Failed to unlink %s: %{errno}d", node.path.c_str(), -rc);
+        result = -1;
+        return false;
+      }
+    } else if (node.kind == Kind::DirectoryPostorder && (node.level > 0 || removeStart)) {
+      // A mount point inside the tree was not descended into, so its directory is
+      // still covered and refuses to go: its files stay untouched.
+      os.ClearFlags(node.path.c_str());
+      if (const int rc = os.RemoveDirectory(node.path.c_str()); rc < 0) {
+        Log(Level::Default, "Failed to remove %s: %{errno}d", node.path.c_str(), -rc);
+        result = -1;
+        return false;
+      }
+    }
+    return true;
+  });
+  if (walk.openError) {
+    Log(Level::Default, "Failed to open path(s) for traversal: %{errno}d", -walk.openError);
+    return -1;
+  }
+  if (walk.closeError) {
+    Log(Level::Default, "Failed to close directory traversal handle: %{errno}d", -walk.closeError);
+    return -1;
+  }
+  return result;
+}
+
+void RemoveStaleMountPoints(const char* mountRoot) {
+  os::Os& os = *CurrentServices().os;
+  std::vector<os::DirectoryEntry> entries;
+  const int listed = os.ReadDirectory(mountRoot, entries);
+  if (listed < 0 && entries.empty()) {
+    if (listed != -ENOENT) Log(Level::Default, "Failed to open %s: %{errno}d", mountRoot, -listed);
+    return;
+  }
+  for (const os::DirectoryEntry& entry : entries) {
+    const std::string joined = (std::string(mountRoot) + "/" + entry.name).substr(0, kPathBufferSize - 1);
+    // A link is removed itself, never resolved: resolving it would aim the removal at
+    // whatever it points to, possibly outside the root. Everything else is resolved,
+    // because the mount table lists resolved paths ("/var/mnt" is "/private/var/mnt").
+    std::string resolved;
+    if (entry.isLink || os.RealPath(joined.c_str(), resolved) < 0) resolved = joined;
+    if (!entry.isLink && CopyEntryForMountPath(resolved)) {
+      Log(Level::Debug, "Skipping destruction of mounted filesystem %s.", resolved.c_str());
+      continue;
+    }
+    Log(Level::Debug, "Attempting destruction of %s.", resolved.c_str());
+    if (entry.isDirectory) {
+      if (RemoveTree(resolved.c_str(), 1) != 0) Log(Level::Default, "Failed to delete %s.", resolved.c_str());
+    } else if (const int rc = os.Unlink(resolved.c_str()); rc < 0) {
+      Log(Level::Default, "Failed to unlink %s: %{errno}d", resolved.c_str(), -rc);
+    }
+  }
+  if (listed < 0) Log(Level::Default, "Failed to close %s: %{errno}d", mountRoot, -listed);
+}
 
 }  // namespace brisvale

@@ -44,6 +44,7 @@ struct VolumeHeaderRead {
 struct DirectoryEntry {
   std::string name;
   bool isDirectory = false;  // asked of the file system when the directory does not say
+  bool isLink = false;       // a symbolic link, which is never a directory here
 };
 
 // A node of a tree walk (see WalkTree).

@@ -21,9 +21,12 @@ struct DirCloser {
   void operator()(DIR* dir) const { ::closedir(dir); }
 };
 
-bool IsDirectoryAt(int dirFd, const char* name) {
+// The entry's type from the file system itself, for directories that do not report it.
+unsigned char TypeAt(int dirFd, const char* name) {
   struct stat status {};
-  return ::fstatat(dirFd, name, &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(status.st_mode);
+  if (::fstatat(dirFd, name, &status, AT_SYMLINK_NOFOLLOW) != 0) return DT_UNKNOWN;
+  if (S_ISDIR(status.st_mode)) return DT_DIR;
+  return S_ISLNK(status.st_mode) ? DT_LNK : DT_REG;
 }
 
 TreeNode::Kind KindOf(const FTSENT& entry) {
@@ -53,9 +56,8 @@ int LinuxOs::ReadDirectory(const char* path, std::vector<DirectoryEntry>& entrie
   while (const dirent* entry = ::readdir(dir.get())) {
     const std::string_view name = entry->d_name;
     if (name == "." || name == "..") continue;
-    const bool isDirectory =
-        entry->d_type == DT_UNKNOWN ? IsDirectoryAt(dirFd, entry->d_name) : entry->d_type == DT_DIR;
-    entries.push_back({std::string(name), isDirectory});
+    const unsigned char type = entry->d_type == DT_UNKNOWN ? TypeAt(dirFd, entry->d_name) : entry->d_type;
+    entries.push_back({std::string(name), type == DT_DIR, type == DT_LNK});
     errno = 0;
   }
   if (errno != 0) return -errno;
