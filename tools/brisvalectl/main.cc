@@ -12,6 +12,7 @@
 #include "base/plist.h"
 #include "json.h"
 #include "platform/linux/ipc_client.h"
+#include "platform/linux/notify_center.h"
 
 namespace {
 
@@ -42,6 +43,10 @@ void PrintUsage(FILE* out) {
       "  raw FILE          send the request property list in FILE (XML or binary) and\n"
       "                    print the reply\n"
       "  post-event NAME   post NAME on the hardware event stream (root only)\n"
+      "  unmount PATH      take away the file system mounted at PATH\n"
+      "  sync PATH         flush the file system mounted at PATH to its device\n"
+      "  watch             print system notifications as they arrive, until interrupted\n"
+      "                    (with --json one JSON object a line)\n"
       "options:\n"
       "  --root DIR        talk to a daemon running in the sandbox root DIR\n"
       "  --json            print replies as JSON\n"
@@ -184,6 +189,62 @@ int PostEvent(const Options& options, const std::string& name) {
   return kOk;
 }
 
+// Requests that name a mount path and answer only with a status.
+int MountPathRequest(const Options& options, const char* type, const std::string& mountPath) {
+  auto result = SendRequest(options, plist::Dictionary{{"RequestType", type}, {"MountPath", plist::Value(mountPath)}});
+  if (int* status = std::get_if<int>(&result)) return *status;
+  const plist::Value& reply = std::get<plist::Value>(result);
+  if (options.json) return PrintReply(options, reply);
+  if (!Succeeded(reply)) {
+    std::fprintf(stderr, "brisvalectl: the daemon answered Failure (its log says why)\n");
+    return kRequestFailed;
+  }
+  std::printf("%s %s: done\n", type, mountPath.c_str());
+  return kOk;
+}
+
+// JSON on one line: the pretty form with its line breaks and indentation dropped (line
+// breaks inside strings are escaped, so none is lost).
+std::string JsonLine(const plist::Value& value) {
+  std::string line;
+  bool skipIndent = false;
+  for (char c : tools::ToJson(value)) {
+    if (c == '\n') {
+      skipIndent = true;
+    } else if (!(skipIndent && c == ' ')) {
+      skipIndent = false;
+      line += c;
+    }
+  }
+  return line;
+}
+
+int Watch(const Options& options) {
+  std::string error;
+  auto subscriber = notify::Subscriber::Create(options.root + notify::kDefaultNotifyDirectory, &error);
+  if (!subscriber) {
+    std::fprintf(stderr, "brisvalectl: %s\n", error.c_str());
+    return kTransportError;
+  }
+  for (;;) {
+    std::optional<notify::Notification> notification = subscriber->Receive(std::nullopt);
+    if (!notification) continue;
+    if (options.json) {
+      plist::Dictionary object{{"name", plist::Value(notification->name)},
+                               {"object", notification->object},
+                               {"distributed", plist::Value::Bool(notification->distributed)}};
+      if (notification->userInfo) object.set("userInfo", plist::Value(*notification->userInfo));
+      std::printf("%s\n", JsonLine(plist::Value(object)).c_str());
+    } else {
+      std::printf("%s  object: %s  user info: %s%s\n", notification->name.c_str(),
+                  notification->object.description().c_str(),
+                  notification->userInfo ? plist::Value(*notification->userInfo).description().c_str() : "-",
+                  notification->distributed ? "  (distributed)" : "");
+    }
+    std::fflush(stdout);
+  }
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -214,6 +275,9 @@ int main(int argc, char** argv) {
   if (command == "list" && args.size() == 1) return List(options);
   if (command == "raw" && args.size() == 2) return Raw(options, args[1]);
   if (command == "post-event" && args.size() == 2) return PostEvent(options, args[1]);
+  if (command == "unmount" && args.size() == 2) return MountPathRequest(options, "Unmount", args[1]);
+  if (command == "sync" && args.size() == 2) return MountPathRequest(options, "Sync", args[1]);
+  if (command == "watch" && args.size() == 1) return Watch(options);
   std::fprintf(stderr, "brisvalectl: bad command line\n");
   PrintUsage(stderr);
   return kUsage;
