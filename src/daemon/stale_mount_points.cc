@@ -77,8 +77,13 @@ void RemoveStaleMountPoints(const char* mountRoot) {
     Log(Level::Debug, "Attempting destruction of %s.", resolved.c_str());
     if (entry.isDirectory) {
       if (RemoveTree(resolved.c_str(), 1) != 0) Log(Level::Default, "Failed to delete %s.", resolved.c_str());
-    } else if (const int rc = os.Unlink(resolved.c_str()); rc < 0) {
-      Log(Level::Default, "Failed to unlink %s: %{errno}d", resolved.c_str(), -rc);
+    } else {
+      // A flagged file directly in the root would otherwise refuse to go, as it would
+      // deeper down.
+      if (!entry.isLink) os.ClearFlags(resolved.c_str());
+      if (const int rc = os.Unlink(resolved.c_str()); rc < 0) {
+        Log(Level::Default, "Failed to unlink %s: %{errno}d", resolved.c_str(), -rc);
+      }
     }
   }
   if (listed < 0) Log(Level::Default, "Failed to close %s: %{errno}d", mountRoot, -listed);

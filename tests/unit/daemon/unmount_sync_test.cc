@@ -1,0 +1,165 @@
+// Unmount, eject and sync over a fake operating system: each failure's exact line and
+// what is left behind.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <cstring>
+
+#include "base/log.h"
+#include "daemon/request_handlers.h"
+#include "fake_os.h"
+#include "platform/services.h"
+#include "platform/system_notify.h"
+#include "registry/registry_model.h"
+
+namespace brisvale {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::IsEmpty;
+
+class RecordingOs : public testing::FakeOs {
+ public:
+  int unmountResult = 0, rmdirResult = 0, openResult = 100, ejectResult = 0, syncResult = 0;
+  std::vector<std::string> calls;
+
+  int Unmount(const char* path, bool force) override {
+    calls.push_back(std::string(force ? "force-unmount " : "unmount ") + path);
+    return unmountResult;
+  }
+  int RemoveDirectory(const char* path) override {
+    calls.push_back(std::string("rmdir ") + path);
+    return rmdirResult;
+  }
+  int OpenDevice(const char* path) override {
+    calls.push_back(std::string("open ") + path);
+    // A real descriptor, since the caller owns and closes it.
+    return openResult < 0 ? openResult : ::dup(STDIN_FILENO);
+  }
+  int EjectDevice(int) override {
+    calls.push_back("eject");
+    return ejectResult;
+  }
+  int SyncFilesystem(const char* path) override {
+    calls.push_back(std::string("sync ") + path);
+    return syncResult;
+  }
+};
+
+class RecordingNotify : public notify::SystemNotify {
+ public:
+  void Post(const notify::Notification& notification) override { posted.push_back(notification.name); }
+  std::vector<std::string> posted;
+};
+
+class UnmountSyncTest : public ::testing::Test {
+ protected:
+  UnmountSyncTest() : services_(Services{&registry_, &os, nullptr, &center}) {
+    os.mounts = {{0, "ext4", "/private/var/mnt/media1", "/dev/sdb1"},
+                 {os::kMountReadOnly, "ext4", "/Developer", "/dev/loop2"}};
+    // Known to the registry but not listed as attached media: only the mounts count.
+    for (const char* name : {"sdb1", "loop2"}) {
+      registry_.Publish(nullptr, "KxMedia",
+                        {{"BSD Name", name}, {"Content", ""}, {"Removable", plist::Value::Bool(false)},
+                         {"Leaf", plist::Value::Bool(true)}});
+    }
+  }
+
+  std::string Run(void (*handler)(const plist::Value&, plist::Dictionary&), plist::Dictionary request) {
+    plist::Dictionary reply{{"Status", "Failure"}};
+    handler(plist::Value(std::move(request)), reply);
+    return *reply.find("Status")->string();
+  }
+
+  std::vector<std::string> DefaultLines() const {
+    std::vector<std::string> lines;
+    for (const log::Line& line : capture.Lines()) {
+      if (line.level == log::Level::Default) lines.push_back(line.text);
+    }
+    return lines;
+  }
+
+  RecordingOs os;
+  RecordingNotify center;
+  log::CaptureSink capture;
+
+ private:
+  registry::RegistryModel registry_;
+  ScopedServices services_;
+};
+
+TEST_F(UnmountSyncTest, UnmountRemovesTheMountPointEjectsAndAnnounces) {
+  EXPECT_EQ(Run(HandleUnmount, {{"MountPath", "/private/var/mnt/media1"}}), "Success");
+  EXPECT_THAT(os.calls, ElementsAre("force-unmount /private/var/mnt/media1", "rmdir /private/var/mnt/media1",
+                                    "open /dev/sdb1", "eject"));
+  EXPECT_THAT(center.posted, ElementsAre("com.vantrel.brisvale_unmounted"));
+
+  // The developer directory is part of the system image and stays.
+  os.calls.clear();
+  EXPECT_EQ(Run(HandleUnmount, {{"MountPath", "/Developer"}}), "Success");
+  EXPECT_THAT(os.calls, ElementsAre("force-unmount /Developer", "open /dev/loop2", "eject"));
+}
+
+TEST_F(UnmountSyncTest, UnmountFailuresLogTheirLineAndLeaveTheRest) {
+  struct Case {
+    const char* name;
+    plist::Dictionary request;
+    int RecordingOs::*knob;
+    int value;
+    std::string status;
+    std::vector<std::string> lines;
+    size_t calls;
+    size_t posted;
+  };
+  const Case cases[] = {
+      {"no path", {}, nullptr, 0, "Failure", {"Invalid value for MountPath: (null)"}, 0, 0},
+      {"path not text", {{"MountPath", plist::Value::Int(3)}}, nullptr, 0, "Failure",
+       {"Invalid value for MountPath: 3"}, 0, 0},
+      {"unknown path", {{"MountPath", "/private/var/mnt/other"}}, nullptr, 0, "Failure",
+       {"There is no matching entry in the device map for /private/var/mnt/other."}, 0, 0},
+      {"unmount refused", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::unmountResult, -EPERM,
+       "Failure", {"Failed to force unmount /private/var/mnt/media1: " + std::string(strerror(EPERM))}, 1, 0},
+      {"directory not empty", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::rmdirResult, -ENOTEMPTY,
+       "Failure", {"Failed to remove /private/var/mnt/media1: " + std::string(strerror(ENOTEMPTY))}, 2, 0},
+      {"open fails", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::openResult, -ENOENT, "Success",
+       {"Failed to open /dev/sdb1 : 2"}, 3, 1},
+      {"eject fails", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::ejectResult, -ENOTTY, "Success",
+       {"Failed to eject /dev/sdb1 : 25"}, 4, 1},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    RecordingOs fresh;
+    fresh.mounts = os.mounts;
+    if (c.knob) fresh.*c.knob = c.value;
+    os = fresh;
+    center.posted.clear();
+    capture.Clear();
+    EXPECT_EQ(Run(HandleUnmount, c.request), c.status);
+    EXPECT_EQ(DefaultLines(), c.lines);
+    EXPECT_EQ(os.calls.size(), c.calls);
+    EXPECT_EQ(center.posted.size(), c.posted);
+  }
+}
+
+TEST_F(UnmountSyncTest, SyncHasItsOwnLines) {
+  EXPECT_EQ(Run(HandleSync, {{"MountPath", "/Developer"}}), "Success");
+  EXPECT_THAT(os.calls, ElementsAre("sync /Developer"));
+  EXPECT_THAT(DefaultLines(), IsEmpty());
+
+  const std::pair<plist::Dictionary, std::string> failures[] = {
+      {{}, "Failed to extract MountPath from request"},
+      {{{"MountPath", "/private/var/mnt/nothing"}}, "There is no matching entry for /private/var/mnt/nothing."},
+  };
+  for (const auto& [request, line] : failures) {
+    capture.Clear();
+    EXPECT_EQ(Run(HandleSync, request), "Failure");
+    EXPECT_THAT(DefaultLines(), ElementsAre(line));
+  }
+  os.syncResult = -EIO;
+  capture.Clear();
+  EXPECT_EQ(Run(HandleSync, {{"MountPath", "/private/var/mnt/media1"}}), "Failure");
+  EXPECT_THAT(DefaultLines(), ElementsAre("Failed to force the sync /private/var/mnt/media1: 5"));
+}
+
+}  // namespace
+}  // namespace brisvale
