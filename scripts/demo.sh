@@ -72,6 +72,19 @@ mount -o ro "$loop" "$sandbox/Developer"
 
 step "$ctl" --root "$sandbox" list
 step "$ctl" --root "$sandbox" list --json
+
+# Notifications as they arrive, while the image is flushed and taken away again.
+"$ctl" --root "$sandbox" watch >"$sandbox.watch" 2>&1 &
+watch_pid=$!
+sleep 0.2
+step "$ctl" --root "$sandbox" sync /Developer
+step "$ctl" --root "$sandbox" unmount /Developer
+step "$ctl" --root "$sandbox" unmount /private/var/mnt/nothing-here
+sleep 0.2
+kill "$watch_pid" 2>/dev/null; wait "$watch_pid" 2>/dev/null || true
+printf '\n\033[1mbrisvalectl watch saw:\033[0m\n'
+cat "$sandbox.watch"; rm -f "$sandbox.watch"
+step "$ctl" --root "$sandbox" list
 request=$(mktemp --suffix=.plist)
 cat >"$request" <<'PLIST'
 <?xml version="1.0" encoding="UTF-8"?>
