@@ -111,11 +111,11 @@ std::string KeepFlags(const std::string& flags, std::string_view allowed) {
 
 std::string PrintfSpec(const Conversion& c, std::string_view allowedFlags, bool withPrecision,
                        std::string_view lengthAndConversion) {
-  std::string spec = "%" + KeepFlags(c.flags, allowedFlags);
-  if (c.width >= 0) spec += std::to_string(c.width);
-  if (withPrecision && c.precision >= 0) spec += "." + std::to_string(c.precision);
-  spec += lengthAndConversion;
-  return spec;
+  std::string conversionText = "%" + KeepFlags(c.flags, allowedFlags);
+  if (c.width >= 0) conversionText += std::to_string(c.width);
+  if (withPrecision && c.precision >= 0) conversionText += "." + std::to_string(c.precision);
+  conversionText += lengthAndConversion;
+  return conversionText;
 }
 
 void AppendSigned(std::string& out, const Conversion& c, int64_t value) {

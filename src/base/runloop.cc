@@ -134,12 +134,12 @@ namespace {
 
 // A zero it_value would disarm the timer, so "now" is one nanosecond away.
 itimerspec TimerSpec(std::chrono::milliseconds delay, std::chrono::milliseconds interval) {
-  itimerspec spec{};
+  itimerspec timer{};
   std::chrono::nanoseconds first = delay;
   if (first <= std::chrono::nanoseconds::zero()) first = std::chrono::nanoseconds(1);
-  spec.it_value = ToTimespec(first);
-  spec.it_interval = ToTimespec(interval);
-  return spec;
+  timer.it_value = ToTimespec(first);
+  timer.it_interval = ToTimespec(interval);
+  return timer;
 }
 
 }  // namespace
@@ -150,8 +150,8 @@ SourceHandle RunLoop::AddTimer(std::chrono::milliseconds delay, Task task) {
   source->onTimer = std::move(task);
   source->fd = ::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK);
   if (source->fd < 0) return {};
-  itimerspec spec = TimerSpec(delay, std::chrono::milliseconds::zero());
-  if (::timerfd_settime(source->fd, 0, &spec, nullptr) < 0) return {};
+  itimerspec timer = TimerSpec(delay, std::chrono::milliseconds::zero());
+  if (::timerfd_settime(source->fd, 0, &timer, nullptr) < 0) return {};
   uint64_t id = nextId_++;
   epoll_event event{};
   event.events = EPOLLIN;
@@ -167,8 +167,8 @@ SourceHandle RunLoop::AddRepeatingTimer(std::chrono::milliseconds interval, Task
   if (!handle) return handle;
   Source& source = *sources_.at(handle.id_);
   source.repeating = true;
-  itimerspec spec = TimerSpec(interval, interval);
-  if (::timerfd_settime(source.fd, 0, &spec, nullptr) < 0) return {};
+  itimerspec timer = TimerSpec(interval, interval);
+  if (::timerfd_settime(source.fd, 0, &timer, nullptr) < 0) return {};
   return handle;
 }
 
