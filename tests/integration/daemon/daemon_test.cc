@@ -1,8 +1,6 @@
 // The daemon in a sandbox root, driven over its real socket.
-#include <signal.h>
 #include <sys/socket.h>
 #include <sys/un.h>
-#include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -21,8 +19,6 @@ namespace {
 using ::testing::Contains;
 using ::testing::Not;
 
-const plist::Value kFailureReply = plist::Dictionary{{"Status", "Failure"}};
-
 struct DaemonTest : ::testing::Test {
   void SetUp() override {
     BRISVALE_REQUIRE_ROOT();
@@ -30,26 +26,6 @@ struct DaemonTest : ::testing::Test {
   }
   SandboxDaemon daemon;
 };
-
-TEST_F(DaemonTest, EveryRequestTypeGetsABinaryReply) {
-  for (const char* type : {"CopyDevices", "Mount", "Unmount", "Sync"}) {
-    std::optional<plist::Value> reply;
-    ipc::ClientReply status = daemon.SendRequest(plist::Dictionary{{"RequestType", type}}, &reply);
-    ASSERT_TRUE(status.ok()) << type << ": " << status.error;
-    ASSERT_TRUE(reply.has_value()) << type << ": reply is not a binary property list";
-    ASSERT_NE(reply->getString("Status"), nullptr) << type;
-    if (std::string(type) != "CopyDevices") {
-      EXPECT_EQ(*reply, kFailureReply) << type;
-    }
-  }
-}
-
-TEST_F(DaemonTest, XmlRequestGetsBinaryReply) {
-  std::string xml = plist::WriteXml(plist::Dictionary{{"RequestType", "Sync"}});
-  std::optional<plist::Value> reply;
-  ASSERT_TRUE(daemon.SendEncoded(plist::Bytes(xml.begin(), xml.end()), &reply).ok());
-  EXPECT_EQ(reply, kFailureReply);
-}
 
 TEST_F(DaemonTest, BadRequestsCancelTheConnectionWithoutReply) {
   std::string xmlArray = plist::WriteXml(plist::Array{"CopyDevices"});
@@ -99,47 +75,6 @@ TEST_F(DaemonTest, CallerWhoseExecutableCarriesTheEntitlementIsServedQuietly) {
                            std::filesystem::path(client).filename().string() + "<";
   EXPECT_THAT(daemon.LogLines(), Contains(::testing::StartsWith(processing)));
   EXPECT_THAT(daemon.LogLines(), Not(Contains(::testing::HasSubstr("entitlement"))));
-}
-
-TEST_F(DaemonTest, OverlappingClientsAreAnsweredInArrivalOrder) {
-  std::optional<ipc::Client> first = ipc::Client::Connect(daemon.ServiceSocket());
-  std::optional<ipc::Client> second = ipc::Client::Connect(daemon.ServiceSocket());
-  ASSERT_TRUE(first && second);
-  auto encode = [](const char* type) {
-    return plist::Dictionary{
-        {"EncodedDictionary", plist::Value(plist::WriteBinary(plist::Dictionary{{"RequestType", type}}))}};
-  };
-  std::optional<int64_t> firstId = first->Send(encode("Sync"));
-  std::optional<int64_t> secondId = second->Send(encode("Unmount"));
-  ASSERT_TRUE(firstId && secondId);
-  EXPECT_TRUE(second->WaitForReply(*secondId, std::chrono::seconds(10)).ok());
-  EXPECT_TRUE(first->WaitForReply(*firstId, std::chrono::seconds(10)).ok());
-  std::vector<std::string> processing;
-  for (const std::string& line : daemon.LogLines()) {
-    if (line.find("Processing VEXA request") != std::string::npos) processing.push_back(line);
-  }
-  ASSERT_EQ(processing.size(), 2u);
-  EXPECT_THAT(processing[0], ::testing::EndsWith(": Sync"));
-  EXPECT_THAT(processing[1], ::testing::EndsWith(": Unmount"));
-}
-
-TEST_F(DaemonTest, ClientKilledMidRequestDoesNotDisturbTheNext) {
-  pid_t child = fork();
-  ASSERT_GE(child, 0);
-  if (child == 0) {
-    std::optional<ipc::Client> client = ipc::Client::Connect(daemon.ServiceSocket());
-    if (!client) _exit(1);
-    const uint8_t halfFrame[] = {0, 0, 1, 0, 'b', 'p', 'l'};
-    if (write(client->fd(), halfFrame, sizeof halfFrame) != sizeof halfFrame) _exit(1);
-    pause();
-    _exit(0);
-  }
-  std::this_thread::sleep_for(std::chrono::milliseconds(100));
-  kill(child, SIGKILL);
-  waitpid(child, nullptr, 0);
-  std::optional<plist::Value> reply;
-  ASSERT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "Sync"}}, &reply).ok());
-  EXPECT_EQ(reply, kFailureReply);
 }
 
 TEST_F(DaemonTest, HardwareEventsAreLoggedByName) {
