@@ -58,6 +58,9 @@ struct TreeNode {
   Kind kind = Kind::Other;
   std::string path;
   int level = 0;  // 0 for the start path
+  // A directory below the start on which another file system is mounted: the walk
+  // reports it before and after, never its contents.
+  bool mountPoint = false;
 };
 
 // How a tree walk ended: 0 when it ran to the end or the visitor stopped it.

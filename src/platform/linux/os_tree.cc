@@ -101,9 +101,16 @@ TreeWalk LinuxOs::WalkTree(const char* root, const std::function<bool(const Tree
     result.openError = -errno;
     return result;
   }
+  dev_t startDevice = 0;
   while (const FTSENT* entry = ::fts_read(walk)) {
-    const TreeNode node{KindOf(*entry), std::string(entry->fts_path, entry->fts_pathlen),
-                        static_cast<int>(entry->fts_level)};
+    TreeNode node{KindOf(*entry), std::string(entry->fts_path, entry->fts_pathlen),
+                  static_cast<int>(entry->fts_level)};
+    const bool directory = entry->fts_info == FTS_D || entry->fts_info == FTS_DP;
+    if (entry->fts_level == FTS_ROOTLEVEL) {
+      if (directory) startDevice = entry->fts_statp->st_dev;
+    } else if (directory) {
+      node.mountPoint = entry->fts_statp->st_dev != startDevice;
+    }
     if (!visit(node)) break;
   }
   if (::fts_close(walk) != 0) result.closeError = -errno;
