@@ -1,5 +1,6 @@
 #include "daemon/stale_mount_points.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <string>
 #include <vector>
@@ -17,6 +18,30 @@ using log::Log;
 
 constexpr size_t kPathBufferSize = 1024;
 
+// Every path something is mounted on. The inventory knows only the mounts of devices
+// it tracks; this keeps a bind mount or a memory file system placed in a root from
+// being emptied too. Empty when the table cannot be read.
+std::vector<std::string> MountedPaths(os::Os& os) {
+  std::vector<os::MountRecord> records;
+  int count = os.GetMountTable(records);
+  if (count > 0) {
+    records.resize(static_cast<size_t>(count));
+    count = os.GetMountTable(records);
+  }
+  if (count < 0) {
+    Log(Level::Default, "Failed to read the mount table: %{errno}d", -count);
+    return {};
+  }
+  std::vector<std::string> paths;
+  for (int i = 0; i < count; ++i) paths.push_back(std::move(records[static_cast<size_t>(i)].mountedOn));
+  return paths;
+}
+
+bool IsMounted(const std::string& path, const std::vector<std::string>& mountedPaths) {
+  if (CopyEntryForMountPath(path)) return true;
+  return std::find(mountedPaths.begin(), mountedPaths.end(), path) != mountedPaths.end();
+}
+
 }  // namespace
 
 int RemoveTree(const char* path, int removeStart) {
@@ -32,10 +57,15 @@ int RemoveTree(const char* path, int removeStart) {
         result = -1;
         return false;
       }
-    } else if (node.kind == Kind::DirectoryPostorder && (node.level > 0 || removeStart)) {
-      // A mount point inside the tree was not descended into, so its directory is
-      // still covered and refuses to go: its files stay untouched.
+    } else if (node.kind == Kind::DirectoryPreorder && !node.mountPoint) {
+      // An immutable or append-only directory refuses to let its entries go, so its
+      // flags go before its contents are visited.
       os.ClearFlags(node.path.c_str());
+    } else if (node.kind == Kind::DirectoryPostorder && (node.level > 0 || removeStart)) {
+      // A mount point inside the tree was not descended into and its flags belong to
+      // the other file system: it is left untouched, and removing its still covered
+      // directory fails and is logged.
+      if (!node.mountPoint) os.ClearFlags(node.path.c_str());
       if (const int rc = os.RemoveDirectory(node.path.c_str()); rc < 0) {
         Log(Level::Default, "Failed to remove %s: %{errno}d", node.path.c_str(), -rc);
         result = -1;
@@ -63,6 +93,7 @@ void RemoveStaleMountPoints(const char* mountRoot) {
     if (listed != -ENOENT) Log(Level::Default, "Failed to open %s: %{errno}d", mountRoot, -listed);
     return;
   }
+  const std::vector<std::string> mountedPaths = entries.empty() ? std::vector<std::string>() : MountedPaths(os);
   for (const os::DirectoryEntry& entry : entries) {
     const std::string joined = (std::string(mountRoot) + "/" + entry.name).substr(0, kPathBufferSize - 1);
     // A link is removed itself, never resolved: resolving it would aim the removal at
@@ -70,7 +101,7 @@ void RemoveStaleMountPoints(const char* mountRoot) {
     // because the mount table lists resolved paths ("/var/mnt" is "/private/var/mnt").
     std::string resolved;
     if (entry.isLink || os.RealPath(joined.c_str(), resolved) < 0) resolved = joined;
-    if (!entry.isLink && CopyEntryForMountPath(resolved)) {
+    if (!entry.isLink && IsMounted(resolved, mountedPaths)) {
       Log(Level::Debug, "Skipping destruction of mounted filesystem %s.", resolved.c_str());
       continue;
     }
