@@ -6,11 +6,13 @@
 // failure, so the core logs the error number without reading errno.
 #pragma once
 
+#include <cerrno>
 #include <cstddef>
 #include <cstdint>
 #include <functional>
 #include <span>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace brisvale::os {
@@ -63,6 +65,12 @@ struct TreeNode {
   bool mountPoint = false;
 };
 
+// A regular file found by ReadFilesBelow, read in full. Valid during the visit only.
+struct FoundFile {
+  std::string_view relativePath;  // from the directory the walk started at
+  std::span<const uint8_t> bytes;
+};
+
 // How a tree walk ended: 0 when it ran to the end or the visitor stopped it.
 struct TreeWalk {
   int openError = 0;   // -errno when the walk could not start
@@ -110,6 +118,16 @@ class Os {
   // another file system: a mount point inside the tree is visited but not descended
   // into. The visitor answers false to stop the walk.
   virtual TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) = 0;
+  // Reads every regular file at any depth below `directory`, hidden ones included, in
+  // directory order, going into a subdirectory as soon as it is met. Never follows a
+  // symbolic link (neither in `directory` itself nor below it), never leaves the file
+  // system `directory` is on, never opens anything in a way that could block. Files
+  // above `maxFileBytes` and everything that is not a regular file are passed over.
+  // The visitor answers false to stop. 0, or -errno when `directory` cannot be opened.
+  virtual int ReadFilesBelow(const char* /*directory*/, size_t /*maxFileBytes*/,
+                             const std::function<bool(const FoundFile&)>& /*visit*/) {
+    return -ENOSYS;
+  }
 };
 
 // The operating system this process runs on.

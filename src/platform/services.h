@@ -17,12 +17,16 @@ class IpcService;
 namespace notify {
 class SystemNotify;
 }
+namespace jobs {
+class JobLauncher;
+}
 
 struct Services {
   registry::DeviceRegistry* registry = nullptr;
   os::Os* os = nullptr;
   ipc::IpcService* ipc = nullptr;
   notify::SystemNotify* notify = nullptr;
+  jobs::JobLauncher* jobLauncher = nullptr;
 };
 
 inline Services& CurrentServices() {
