@@ -71,6 +71,17 @@ struct FoundFile {
   std::span<const uint8_t> bytes;
 };
 
+// What lstat or fstat tells about a file.
+struct FileStatus {
+  uint32_t mode = 0;  // type bits (0xF000) and permissions
+  uint64_t device = 0;
+  uint64_t inode = 0;
+  uint64_t linkCount = 0;
+};
+inline constexpr uint32_t kFileTypeMask = 0xF000;
+inline constexpr uint32_t kFileTypeRegular = 0x8000;
+inline constexpr uint32_t kFileTypeDirectory = 0x4000;
+
 // How a tree walk ended: 0 when it ran to the end or the visitor stopped it.
 struct TreeWalk {
   int openError = 0;   // -errno when the walk could not start
@@ -128,6 +139,24 @@ class Os {
                              const std::function<bool(const FoundFile&)>& /*visit*/) {
     return -ENOSYS;
   }
+
+  // The file at `path` itself, a link not followed.
+  virtual int StatPath(const char* /*path*/, FileStatus& /*status*/) { return -ENOSYS; }
+  virtual int StatDescriptor(int /*fd*/, FileStatus& /*status*/) { return -ENOSYS; }
+  virtual int MakeDirectory(const char* /*path*/, uint32_t /*mode*/) { return -ENOSYS; }
+  // Makes a new directory from `pathTemplate`, whose trailing "XXXXXX" characters are
+  // replaced in place.
+  virtual int MakeTemporaryDirectory(std::string& /*pathTemplate*/) { return -ENOSYS; }
+  virtual int ChangeMode(const char* /*path*/, uint32_t /*mode*/) { return -ENOSYS; }
+  // A read-only descriptor for the file at `path`, never through a link as its last
+  // component, owned by the caller.
+  virtual int OpenImageFile(const char* /*path*/) { return -ENOSYS; }
+  // A read lease on `fd` (opened read-only): refused while anyone has the file open for
+  // writing, and broken by anyone opening it for writing or truncating it later. It
+  // lasts until the descriptor is closed.
+  virtual int TakeReadLease(int /*fd*/) { return -ENOSYS; }
+  // False once the lease on `fd` has been broken, or was never held.
+  virtual bool HoldsReadLease(int /*fd*/) { return false; }
 };
 
 // The operating system this process runs on.

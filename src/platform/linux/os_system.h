@@ -28,6 +28,15 @@ class LinuxOs final : public Os {
   int RealPath(const char* path, std::string& resolved) override;
   int ClearFlags(const char* path) override;
   TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) override;
+  // os_image_file.cc
+  int StatPath(const char* path, FileStatus& status) override;
+  int StatDescriptor(int fd, FileStatus& status) override;
+  int MakeDirectory(const char* path, uint32_t mode) override;
+  int MakeTemporaryDirectory(std::string& pathTemplate) override;
+  int ChangeMode(const char* path, uint32_t mode) override;
+  int OpenImageFile(const char* path) override;
+  int TakeReadLease(int fd) override;
+  bool HoldsReadLease(int fd) override;
 
  private:
   UniqueFd mountInfo_;               // /proc/self/mountinfo, opened on first use
