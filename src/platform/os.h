@@ -10,6 +10,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <functional>
+#include <memory>
 #include <span>
 #include <string>
 #include <string_view>
@@ -88,6 +89,25 @@ struct TreeWalk {
   int closeError = 0;  // -errno when it could not be closed
 };
 
+// The arguments of an image volume mount, as the platform's HFS mount takes them.
+struct VolumeMountArguments {
+  std::string devicePath;
+  uint32_t ownerUid = 0;
+  uint32_t ownerGid = 0;
+  uint16_t permissionMask = 0777;
+  uint32_t textEncoding = 0xFFFFFFFF;  // none chosen
+};
+
+// Mount flags of MountVolume.
+inline constexpr uint32_t kMountUnion = 0x20;
+
+// A read-only mapping of a file; unmapped when destroyed.
+class FileMapping {
+ public:
+  virtual ~FileMapping() = default;
+  virtual std::span<const uint8_t> Bytes() const = 0;
+};
+
 class Os {
  public:
   virtual ~Os() = default;
@@ -157,6 +177,22 @@ class Os {
   virtual int TakeReadLease(int /*fd*/) { return -ENOSYS; }
   // False once the lease on `fd` has been broken, or was never held.
   virtual bool HoldsReadLease(int /*fd*/) { return false; }
+
+  // Mounts the volume on `arguments.devicePath` at `mountPoint` with the platform's
+  // file-system `type` ("hfs") and flags (kMountReadOnly, kMountUnion).
+  virtual int MountVolume(const char* type, const char* mountPoint, uint32_t flags,
+                          const VolumeMountArguments& arguments) = 0;
+  // The text-encoding bias the file system `type` was loaded with.
+  virtual int EncodingBias(const char* type, int32_t& bias) = 0;
+  // The home directory of user `uid` in the user database.
+  virtual int UserHomeDirectory(uint32_t uid, std::string& home) = 0;
+  // At most `maxLength` bytes from the start of the file at `path`.
+  virtual int ReadFile(const char* path, size_t maxLength, std::vector<uint8_t>& contents) = 0;
+  // A read-only descriptor for the file at `path`, owned by the caller, or -errno.
+  virtual int OpenFile(const char* path) = 0;
+  virtual int FileSize(int fd, uint64_t& size) = 0;
+  // Maps the first `length` bytes of `fd` read-only and private.
+  virtual int MapFile(int fd, size_t length, std::unique_ptr<FileMapping>& mapping) = 0;
 };
 
 // The operating system this process runs on.
