@@ -160,6 +160,10 @@ std::optional<std::string> AttachAndMountImage(std::string_view imagePath, std::
   std::optional<std::string> deviceNode = MountImageVolume(*bsdName, mountPath);
   if (!deviceNode) {
     Log(Level::Default, "Failed to mount %@ on %@", imagePath, mountPath);
+    // An image whose volume cannot be mounted is of no use attached; nothing else would
+    // ever let it go. (After a version mismatch the volume mount has already let go,
+    // and this second eject only logs that the device is free.)
+    EjectDevice(("/dev/" + *bsdName).c_str());
     return std::nullopt;
   }
   return deviceNode;
