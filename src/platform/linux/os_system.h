@@ -28,6 +28,9 @@ class LinuxOs final : public Os {
   int RealPath(const char* path, std::string& resolved) override;
   int ClearFlags(const char* path) override;
   TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) override;
+  // os_files_below.cc
+  int ReadFilesBelow(const char* directory, size_t maxFileBytes,
+                     const std::function<bool(const FoundFile&)>& visit) override;
 
  private:
   UniqueFd mountInfo_;               // /proc/self/mountinfo, opened on first use
