@@ -1,0 +1,134 @@
+#include "jobs/image_jobs.h"
+
+#include <gtest/gtest.h>
+
+#include <set>
+
+#include "base/log.h"
+#include "fake_os.h"
+#include "job_files.h"
+#include "platform/job_launcher.h"
+#include "platform/linux/os_system.h"
+#include "platform/services.h"
+#include "plist_printers.h"
+
+namespace brisvale {
+namespace {
+
+using plist::Array;
+using plist::Dictionary;
+using plist::Value;
+using testing::Job;
+
+// The real file system, seen from a temporary directory standing in for "/".
+struct RootedOs : testing::FakeOs {
+  std::string root;
+  int ReadFilesBelow(const char* directory, size_t maxFileBytes,
+                     const std::function<bool(const os::FoundFile&)>& visit) override {
+    return os::SystemOs().ReadFilesBelow((root + directory).c_str(), maxFileBytes, visit);
+  }
+};
+
+struct RecordingLauncher : jobs::JobLauncher {
+  std::vector<Dictionary> submitted;
+  std::set<std::string> refused;  // labels answered with a failure
+  std::optional<jobs::LaunchError> Submit(const Dictionary& job) override {
+    const std::string label = *job.find("Label")->string();
+    if (refused.count(label)) return jobs::LaunchError{"already loaded: " + label};
+    submitted.push_back(job);
+    return std::nullopt;
+  }
+  std::vector<std::string> Labels() const {
+    std::vector<std::string> labels;
+    for (const Dictionary& job : submitted) labels.push_back(*job.find("Label")->string());
+    return labels;
+  }
+};
+
+struct ImageJobs : ::testing::Test {
+  testing::TempTree tree;
+  RootedOs os;
+  RecordingLauncher launcher;
+  ScopedServices services{Services{.os = &os, .jobLauncher = &launcher}};
+  log::CaptureSink capture;
+  ImageJobs() { os.root = tree.root.string(); }
+
+  // The files of `directory` in the order the scan meets them.
+  std::vector<std::string> ScanOrder(const std::string& directory) {
+    std::vector<std::string> names;
+    os.ReadFilesBelow(directory.c_str(), 1 << 20, [&](const os::FoundFile& file) {
+      names.emplace_back(file.relativePath);
+      return true;
+    });
+    return names;
+  }
+};
+
+TEST_F(ImageJobs, ImageWithoutJobDirectoriesLoadsNothing) {
+  EXPECT_EQ(LoadImageJobs("/Developer", "Developer"), 0);
+  EXPECT_TRUE(launcher.submitted.empty());
+  EXPECT_TRUE(capture.Texts().empty());
+}
+
+TEST_F(ImageJobs, FactoryJobsAreRewrittenAndRefusalsOnlyLogged) {
+  const char* mount = "/private/var/factory_mount";
+  tree.Write("private/var/factory_mount/Library/OrbitDaemons/agent.plist",
+             Value(Dictionary{{"Label", "agent"}, {"Program", "/Developer/usr/libexec/agent"}}));
+  tree.Write("private/var/factory_mount/System/Library/OrbitDaemons/dup.plist",
+             Value(Job("dup", Value("/Developer/x"))));
+  launcher.refused = {"dup"};
+
+  EXPECT_EQ(LoadImageJobs(mount, "Factory"), 0);
+  const Dictionary expected = Job("agent", Value(Array{"/var/factory_mount/usr/libexec/agent"}));
+  EXPECT_EQ(launcher.submitted, std::vector<Dictionary>{expected});
+  EXPECT_TRUE(capture.Contains(Level::Debug, "Submitting orbitd job: \n" + Value(expected).description()));
+  EXPECT_TRUE(capture.Contains(Level::Default, "JvJobSubmit failed: already loaded: dup"));
+}
+
+TEST_F(ImageJobs, RewriteDependsOnTheImageTypeAndMountPoint) {
+  struct Case {
+    const char* type;
+    std::string mountPoint;
+    const char* program;
+    const char* submittedProgram;
+  } cases[] = {
+      {"Personalized", "/private/var/personalized_demo", "/var/personalized_demo/x",
+       "/var/personalized_demo/x"},
+      {"Personalized", "/private/var/personalized_factory", "/Developer/x",
+       "/var/personalized_factory/x"},
+      {"Developer", "/private/var/factory_mount", "/Developer/x", "/Developer/x"},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.mountPoint);
+    launcher.submitted.clear();
+    tree.Write(c.mountPoint.substr(1) + "/System/Library/OrbitDaemons/j", Value(Job("j", Value(c.program))));
+    EXPECT_EQ(LoadImageJobs(c.mountPoint, c.type), 0);
+    const Array expected{c.submittedProgram};
+    ASSERT_EQ(launcher.submitted.size(), 1u);
+    EXPECT_EQ(*launcher.submitted[0].find("ProgramArguments"),
+              std::string_view(c.program) == c.submittedProgram ? Value(c.program) : Value(expected));
+  }
+}
+
+TEST_F(ImageJobs, FailureStopsEachScanButNotTheSecondDirectory) {
+  const std::string first = "Developer/Library/OrbitDaemons/";
+  const std::string second = "Developer/System/Library/OrbitDaemons/";
+  for (const char* name : {"1", "2"}) {
+    tree.Write(first + name, Value());
+    tree.Write(second + name, Value(Job(std::string("second") + name, Value("/Developer/x"))));
+  }
+  // Which file the scan meets first is up to the file system: the good job goes there.
+  const std::vector<std::string> order = ScanOrder("/" + first);
+  ASSERT_EQ(order.size(), 2u);
+  tree.Write(first + order[0], Value(Job("good", Value("/Developer/x"))));
+  tree.Write(first + order[1], Value(Job("bad", Value("/usr/bin/x"))));
+
+  EXPECT_EQ(LoadImageJobs("/Developer", "Developer"), -1);
+  const std::vector<std::string> labels = launcher.Labels();
+  ASSERT_EQ(labels.size(), 2u);
+  EXPECT_EQ(labels[0], "good");
+  EXPECT_TRUE(labels[1] == "second1" || labels[1] == "second2") << labels[1];
+}
+
+}  // namespace
+}  // namespace brisvale
