@@ -1,9 +1,8 @@
-// Helpers shared by the job tests: a temporary directory tree and job files in it.
+// A temporary directory tree for the job tests, removed with everything in it.
 #pragma once
 
 #include <unistd.h>
 
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <string>
@@ -12,7 +11,6 @@
 
 namespace brisvale::testing {
 
-// A directory removed with everything in it when the test ends.
 struct TempTree {
   std::filesystem::path root;
   TempTree() {
@@ -21,17 +19,12 @@ struct TempTree {
   }
   ~TempTree() { std::filesystem::remove_all(root); }
 
-  // Writes `value` at `relative` (parents created), binary or XML.
+  // Writes `value` at `relative`, parents created, as a binary or XML property list.
   void Write(const std::string& relative, const plist::Value& value, bool xml = false) const {
-    const std::filesystem::path path = root / relative;
-    std::filesystem::create_directories(path.parent_path());
-    std::ofstream out(path, std::ios::binary);
-    if (xml) {
-      out << plist::WriteXml(value);
-    } else {
-      const plist::Bytes bytes = plist::WriteBinary(value);
-      out.write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
-    }
+    std::filesystem::create_directories((root / relative).parent_path());
+    const plist::Bytes bytes = xml ? plist::Bytes() : plist::WriteBinary(value);
+    std::ofstream(root / relative, std::ios::binary)
+        << (xml ? plist::WriteXml(value) : std::string(bytes.begin(), bytes.end()));
   }
 };
 
