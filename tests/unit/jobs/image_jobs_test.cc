@@ -60,6 +60,11 @@ TEST_F(ImageJobs, FactoryJobsAreRewrittenAndRefusalsOnlyLogged) {
   EXPECT_EQ(launcher.submitted, std::vector<Dictionary>{expected});
   EXPECT_TRUE(capture.Contains(Level::Debug, "Submitting orbitd job: \n" + Value(expected).description()));
   EXPECT_TRUE(capture.Contains(Level::Default, "JvJobSubmit failed: already loaded: dup"));
+
+  tree.Write("private/var/factory_mount/e/Library/OrbitDaemons/j",
+             Value(Dictionary{{"Program", "/Developer/x"}, {"ERROR", "from the job"}}));
+  EXPECT_EQ(LoadImageJobs("/private/var/factory_mount/e", "Factory"), -1);
+  EXPECT_TRUE(capture.Contains(Level::Default, "Failed to copy/fix pist: from the job"));
 }
 
 TEST_F(ImageJobs, RewriteDependsOnTheImageTypeAndMountPoint) {
