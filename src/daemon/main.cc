@@ -13,6 +13,7 @@
 #include "daemon/matching_context.h"
 #include "daemon/stale_mount_points.h"
 #include "platform/linux/ipc_linux.h"
+#include "platform/linux/jobs_spool.h"
 #include "platform/linux/notify_center.h"
 #include "platform/linux/os_sandbox.h"
 #include "platform/linux/registry_disk_images.h"
@@ -132,7 +133,9 @@ int main(int argc, char** argv) {
   }
   std::unique_ptr<ipc::IpcService> ipc = CreateLinuxIpcService(loop, IpcOptions{});
   std::unique_ptr<notify::SystemNotify> notifier = notify::CreateLinuxSystemNotify();
-  ScopedServices services(Services{&registry, &os::SystemOs(), ipc.get(), notifier.get()});
+  jobs::SpoolJobLauncher jobLauncher;
+  ScopedServices services(
+      Services{&registry, &os::SystemOs(), ipc.get(), notifier.get(), &jobLauncher});
 
   // Without the port no media or camera notification could ever arrive: a daemon that
   // cannot create it would serve requests but silently ignore hardware, so it stops.
