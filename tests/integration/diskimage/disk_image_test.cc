@@ -11,6 +11,7 @@
 
 #include "base/unique_fd.h"
 #include "loop_mount.h"
+#include "platform/linux/loop_device.h"
 #include "platform/linux/notify_center.h"
 #include "plist_printers.h"
 #include "sandbox_daemon.h"
@@ -324,6 +325,30 @@ TEST_F(DiskImageTest, ImageOpenForWritingOrLinkedElsewhereIsRefused) {
   EXPECT_EQ(*reply, kFailure);
   EXPECT_TRUE(daemon.LogContains("default: " + inside + " has 2 links; only a file with one link is mounted."));
   EXPECT_THAT(LeftBehind(daemon.root()), IsEmpty());
+}
+
+TEST_F(DiskImageTest, ImageDeviceOfADaemonKilledMidMountIsDetachedOnRestart) {
+  // What a kill between the controller's attach and the volume mount leaves: the
+  // staged image on a loop device carrying the attach identifier, nothing mounted.
+  const std::string image = BuildImage();
+  fs::create_directories(daemon.Path("/private/var/run/staging"));
+  const std::string staged = daemon.Path("/private/var/run/staging/killed.img");
+  fs::copy_file(image, staged);
+  const UniqueFd file(::open(staged.c_str(), O_RDONLY | O_CLOEXEC));
+  loop::AttachOptions options;
+  options.identifier = "0F1E2D3C-4B5A-4978-8695-A4B3C2D1E0F9";
+  options.deviceRoot = daemon.Path("/dev");
+  loop::LoopDevice device;
+  ASSERT_EQ(loop::Attach(file.get(), options, device), 0);
+  device.Release();
+  ASSERT_THAT(LeftBehind(daemon.root()), ElementsAre(staged));
+
+  daemon.Stop();
+  ASSERT_TRUE(daemon.Start());
+  EXPECT_THAT(LeftBehind(daemon.root()), IsEmpty());
+  // And the restarted daemon mounts as before.
+  EXPECT_EQ(Mount("Developer", image, Sign(image)), Success("/Developer"));
+  Unmount("/Developer");
 }
 
 }  // namespace
