@@ -122,6 +122,10 @@ class ControllerClient final : public UserClient {
 
 // Writes `bytes` to `directory`/`name` so that the name only ever shows a whole file.
 int WriteAtomically(const std::string& directory, const std::string& name, std::span<const uint8_t> bytes) {
+  // The run-time directory may be fresh (a new root, a reboot): make what is missing.
+  for (size_t slash = directory.find('/', 1); slash != std::string::npos; slash = directory.find('/', slash + 1)) {
+    ::mkdir(directory.substr(0, slash).c_str(), 0755);
+  }
   ::mkdir(directory.c_str(), 0700);
   const UniqueFd dir(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   if (!dir) return -errno;
