@@ -6,7 +6,7 @@
 #include <span>
 #include <string>
 
-#include "diskimage/volume_mount.h"
+#include "diskimage/text_encoding.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (size < 4) return 0;
