@@ -1,6 +1,5 @@
 #include "platform/linux/registry_disk_images.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <linux/loop.h>
 #include <sys/ioctl.h>
@@ -9,6 +8,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <filesystem>
 #include <vector>
 
 #include "base/hex.h"
@@ -122,6 +122,10 @@ class ControllerClient final : public UserClient {
 
 // Writes `bytes` to `directory`/`name` so that the name only ever shows a whole file.
 int WriteAtomically(const std::string& directory, const std::string& name, std::span<const uint8_t> bytes) {
+  // The run-time directory may be fresh (a new root, a reboot): make what is missing.
+  for (size_t slash = directory.find('/', 1); slash != std::string::npos; slash = directory.find('/', slash + 1)) {
+    ::mkdir(directory.substr(0, slash).c_str(), 0755);
+  }
   ::mkdir(directory.c_str(), 0700);
   const UniqueFd dir(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   if (!dir) return -errno;
@@ -208,15 +212,11 @@ int DetachAbandonedImageDevices(const std::string& root) {
   while (prefix.size() > 1 && prefix.back() == '/') prefix.pop_back();
   if (prefix != "/") prefix += '/';
   int detached = 0;
-  const UniqueFd blocks(::open("/sys/block", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!blocks) return 0;
-  DIR* directory = ::fdopendir(::dup(blocks.get()));
-  if (!directory) return 0;
   std::vector<std::string> names;
-  while (const dirent* entry = ::readdir(directory)) {
-    if (std::string_view(entry->d_name).starts_with("loop")) names.emplace_back(entry->d_name);
+  std::error_code error;
+  for (const auto& entry : std::filesystem::directory_iterator("/sys/block", error)) {
+    if (std::string name = entry.path().filename(); name.starts_with("loop")) names.push_back(std::move(name));
   }
-  ::closedir(directory);
   for (const std::string& name : names) {
     std::string backing = ReadSysfsText("/sys/block/" + name + "/loop/backing_file");
     if (backing.ends_with(" (deleted)")) backing.resize(backing.size() - 10);

@@ -2,8 +2,6 @@
 // tmpfs mounts. Needs root; every test skips itself otherwise.
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <linux/loop.h>
-#include <sys/ioctl.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
@@ -14,6 +12,7 @@
 #include <string>
 
 #include "base/runloop.h"
+#include "platform/linux/loop_device.h"
 #include "platform/os.h"
 #include "platform/system_devices.h"
 
@@ -48,39 +47,20 @@ class TempDir {
 class LoopDevice {
  public:
   LoopDevice(const std::string& image, const char* identifier) {
-    int control = open("/dev/loop-control", O_RDWR | O_CLOEXEC);
-    if (control < 0) return;
-    int number = ioctl(control, LOOP_CTL_GET_FREE);
-    close(control);
-    if (number < 0) return;
-    name_ = "loop" + std::to_string(number);
-    fd_ = open(("/dev/" + name_).c_str(), O_RDWR | O_CLOEXEC);
-    int backing = open(image.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd_ < 0 || backing < 0) {
-      if (backing >= 0) close(backing);
-      return;
-    }
-    loop_config config{};
-    config.fd = static_cast<uint32_t>(backing);
-    config.info.lo_flags = LO_FLAGS_READ_ONLY | LO_FLAGS_AUTOCLEAR;
-    std::strncpy(reinterpret_cast<char*>(config.info.lo_file_name), identifier, LO_NAME_SIZE - 1);
-    attached_ = ioctl(fd_, LOOP_CONFIGURE, &config) == 0;
+    const int backing = open(image.c_str(), O_RDONLY | O_CLOEXEC);
+    if (backing < 0) return;
+    loop::AttachOptions options;
+    options.autoclear = true;
+    options.identifier = identifier;
+    loop::Attach(backing, options, device_);
     close(backing);
   }
-  ~LoopDevice() { Detach(); }
-  void Detach() {
-    if (attached_) ioctl(fd_, LOOP_CLR_FD, 0);
-    attached_ = false;
-    if (fd_ >= 0) close(fd_);
-    fd_ = -1;
-  }
-  bool attached() const { return attached_; }
-  const std::string& name() const { return name_; }
+  void Detach() { device_.Detach(); }
+  bool attached() const { return static_cast<bool>(device_); }
+  std::string name() const { return device_.name(); }
 
  private:
-  std::string name_;
-  int fd_ = -1;
-  bool attached_ = false;
+  loop::LoopDevice device_;
 };
 
 class Mount {
