@@ -30,7 +30,7 @@ struct DirCloser {
 };
 using UniqueDir = std::unique_ptr<DIR, DirCloser>;
 
-struct Level {
+struct OpenDirectory {
   UniqueDir dir;
   std::string prefix;  // relative path of this directory, "" or ending in "/"
 };
@@ -100,12 +100,12 @@ int LinuxOs::ReadFilesBelow(const char* directory, size_t maxFileBytes,
   if (!startDir) return -errno;
   start.release();
 
-  std::vector<Level> stack;
+  std::vector<OpenDirectory> stack;
   stack.push_back({std::move(startDir), ""});
   std::vector<uint8_t> bytes;
   size_t entries = 0;
   while (!stack.empty()) {
-    Level& level = stack.back();
+    OpenDirectory& level = stack.back();
     const dirent* entry = ::readdir(level.dir.get());
     if (!entry) {
       stack.pop_back();

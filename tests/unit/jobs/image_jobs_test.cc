@@ -44,18 +44,14 @@ struct ImageJobs : ::testing::Test {
   ScopedServices services{Services{.os = &os, .jobLauncher = &launcher}};
   log::CaptureSink capture;
   ImageJobs() { os.root = tree.root.string(); }
-
 };
 
 TEST_F(ImageJobs, FactoryJobsAreRewrittenAndRefusalsOnlyLogged) {
-  const char* mount = "/private/var/factory_mount";
   tree.Write("private/var/factory_mount/Library/OrbitDaemons/agent.plist",
              Value(Dictionary{{"Label", "agent"}, {"Program", "/Developer/usr/libexec/agent"}}));
-  tree.Write("private/var/factory_mount/System/Library/OrbitDaemons/dup.plist",
-             Value(Job("dup", Value("/Developer/x"))));
+  tree.Write("private/var/factory_mount/System/Library/OrbitDaemons/dup.plist", Value(Job("dup", Value("/Developer/x"))));
   launcher.refused = "dup";
-
-  EXPECT_EQ(LoadImageJobs(mount, "Factory"), 0);
+  EXPECT_EQ(LoadImageJobs("/private/var/factory_mount", "Factory"), 0);
   const Dictionary expected = Job("agent", Value(Array{"/var/factory_mount/usr/libexec/agent"}));
   EXPECT_EQ(launcher.submitted, std::vector<Dictionary>{expected});
   EXPECT_TRUE(capture.Contains(Level::Debug, "Submitting orbitd job: \n" + Value(expected).description()));
@@ -68,28 +64,23 @@ TEST_F(ImageJobs, FactoryJobsAreRewrittenAndRefusalsOnlyLogged) {
 }
 
 TEST_F(ImageJobs, RewriteDependsOnTheImageTypeAndMountPoint) {
-  struct Case {
-    const char* type;
-    std::string mountPoint;
-    Value submittedProgram;
-  } cases[] = {
-      {"Personalized", "/private/var/personalized_factory", Value(Array{"/var/personalized_factory/x"})},
-      {"Developer", "/private/var/factory_mount", Value("/Developer/x")},
-  };
   EXPECT_EQ(LoadImageJobs("/Developer", "Developer"), 0);  // no job directories at all
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.mountPoint);
-    tree.Write(c.mountPoint.substr(1) + "/System/Library/OrbitDaemons/j", Value(Job("j", Value("/Developer/x"))));
-    EXPECT_EQ(LoadImageJobs(c.mountPoint, c.type), 0);
-    ASSERT_EQ(launcher.submitted.size(), 1u);
-    EXPECT_EQ(*launcher.submitted[0].find("ProgramArguments"), c.submittedProgram);
+  const std::pair<const char*, Value> cases[] = {
+      {"Personalized", Value(Array{"/var/personalized_factory/x"})},  // under the personalized factory root
+      {"Developer", Value("/Developer/x")},
+  };
+  for (const auto& [type, program] : cases) {
+    SCOPED_TRACE(type);
     launcher.submitted.clear();
+    tree.Write("private/var/personalized_factory/System/Library/OrbitDaemons/j", Value(Job("j", Value("/Developer/x"))));
+    EXPECT_EQ(LoadImageJobs("/private/var/personalized_factory", type), 0);
+    ASSERT_EQ(launcher.submitted.size(), 1u);
+    EXPECT_EQ(*launcher.submitted[0].find("ProgramArguments"), program);
   }
 }
 
 TEST_F(ImageJobs, FailureStopsEachScanButNotTheSecondDirectory) {
-  const std::string first = "Developer/Library/OrbitDaemons/";
-  const std::string second = "Developer/System/Library/OrbitDaemons/";
+  const std::string first = "Developer/Library/OrbitDaemons/", second = "Developer/System/Library/OrbitDaemons/";
   for (const char* name : {"1", "2"}) {
     tree.Write(first + name, Value());
     tree.Write(second + name, Value(Job(std::string("second") + name, Value("/Developer/x"))));

@@ -12,11 +12,8 @@
 namespace brisvale::testing {
 
 struct TempTree {
-  std::filesystem::path root;
-  TempTree() {
-    char pattern[] = "/tmp/brisvale-jobs-XXXXXX";
-    root = ::mkdtemp(pattern);
-  }
+  std::string pattern = "/tmp/brisvale-jobs-XXXXXX";
+  std::filesystem::path root = ::mkdtemp(pattern.data());
   ~TempTree() { std::filesystem::remove_all(root); }
 
   // Writes `value` at `relative`, parents created, as a binary or XML property list.

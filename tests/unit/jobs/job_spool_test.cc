@@ -25,10 +25,7 @@ TEST(JobSpool, RefusesBadAndDuplicateLabelsWithoutWriting) {
   SpoolJobLauncher launcher((tree.root / "jobs").string());
   const Dictionary loaded{{"Label", "com.x.agent"}, {"Program", "/bin/first"}};
   ASSERT_EQ(launcher.Submit(loaded), std::nullopt);
-  struct Case {
-    std::optional<Value> label;
-    const char* description;
-  } cases[] = {
+  const std::pair<std::optional<Value>, const char*> cases[] = {
       {std::nullopt, "the job has no Label"},
       {Value::Int(3), "the job's Label is not a string"},
       {Value(""), "the job's Label is empty"},
@@ -39,11 +36,11 @@ TEST(JobSpool, RefusesBadAndDuplicateLabelsWithoutWriting) {
       {Value(std::string(256, 'x')), "the job's Label is longer than a file name may be"},
       {Value("com.x.agent"), "a job labelled \"com.x.agent\" is already loaded"},
   };
-  for (const Case& c : cases) {
+  for (const auto& [label, description] : cases) {
     Dictionary job{{"Program", "/bin/second"}};
-    if (c.label) job.set("Label", *c.label);
+    if (label) job.set("Label", *label);
     const std::optional<LaunchError> error = launcher.Submit(job);
-    EXPECT_EQ(error ? error->description : "submitted", c.description);
+    EXPECT_EQ(error ? error->description : "submitted", description);
   }
   const auto spooled = ReadJobSpool((tree.root / "jobs").string(), nullptr);
   ASSERT_TRUE(spooled && spooled->size() == 1);

@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
-#include <fstream>
 #include <set>
 
 #include "base/log.h"
@@ -15,49 +14,39 @@
 namespace brisvale {
 namespace {
 
-using plist::Array;
 using plist::Dictionary;
 using plist::Value;
 using testing::Job;
 using Lines = std::vector<std::string>;
 
 const PlistProcessor& Processor() { return PlistProcessor::sharedPlistProcessor(); }
-Value Args(std::initializer_list<Value> args) { return Value(Array(args)); }
+Value Args(std::initializer_list<Value> args) { return Value(plist::Array(args)); }
 
 TEST(PlistProcessor, VerifiesTheProgramAgainstTheRootOfTheMountPoint) {
   const Value tool = Args({"/Developer/usr/bin/tool", "-x"});
   struct Case {
-    const char* why;
     Dictionary job;
     std::optional<std::string_view> mountPoint;
     bool verifies;
     Lines logged;
   } cases[] = {
-      {"developer image", Job("a", tool), "/Developer", true, {}},
-      {"developer job on a personalized debug image", Job("a", tool),
-       "/private/var/personalized_debug/x", false, {}},
-      {"plain prefix test", Job("a", Args({"/DeveloperTools/x"})), "/Developer", true, {}},
-      {"program normalized", Job("a", Args({"/var/personalized_demo/usr/bin/tool"})),
-       "/private/var/personalized_demo", true, {}},
-      {"both normalized", Job("a", Args({"/private/var/personalized_demo/usr/bin/tool"})),
-       "/var/personalized_demo", true, {}},
-      {"factory roots ask for /Developer", Job("a", Value("/Developer/bin/x")),
-       "/private/var/personalized_factory/f", true, {}},
-      {"factory root refuses its own path", Job("a", Args({"/private/var/factory_mount/x"})),
-       "/private/var/factory_mount", false, {}},
-      {"Program alone", Dictionary{{"Program", "/private/var/debug_mount/x"}},
-       "/private/var/debug_mount", true, {}},
-      {"mount point outside every root", Job("a", tool), "/mnt/usb", false, {}},
-      {"number does not fall back to Program",
-       Dictionary{{"ProgramArguments", Value::Int(7)}, {"Program", "/Developer/x"}}, "/Developer",
-       false, {"Unexpected object: 7", "Failed to retrieve program arguments."}},
-      {"empty arguments", Job("a", Args({})), "/Developer", false, {"Failed to normalize (null)."}},
-      {"first argument not text", Job("a", Args({Value::Bool(true)})), "/Developer", false,
-       {"Failed to normalize true."}},
-      {"no mount point", Job("a", tool), std::nullopt, false, {"Invalid input."}},
+      {Job("a", tool), "/Developer", true, {}},
+      {Job("a", tool), "/private/var/personalized_debug/x", false, {}},
+      {Job("a", Args({"/DeveloperTools/x"})), "/Developer", true, {}},  // plain prefix test
+      {Job("a", Args({"/var/personalized_demo/usr/bin/tool"})), "/private/var/personalized_demo", true, {}},
+      {Job("a", Args({"/private/var/personalized_demo/usr/bin/tool"})), "/var/personalized_demo", true, {}},
+      {Job("a", Value("/Developer/bin/x")), "/private/var/personalized_factory/f", true, {}},
+      {Job("a", Args({"/private/var/factory_mount/x"})), "/private/var/factory_mount", false, {}},
+      {Dictionary{{"Program", "/private/var/debug_mount/x"}}, "/private/var/debug_mount", true, {}},
+      {Job("a", tool), "/mnt/usb", false, {}},
+      {Dictionary{{"ProgramArguments", Value::Int(7)}, {"Program", "/Developer/x"}}, "/Developer", false,
+       {"Unexpected object: 7", "Failed to retrieve program arguments."}},
+      {Job("a", Args({})), "/Developer", false, {"Failed to normalize (null)."}},
+      {Job("a", Args({Value::Bool(true)})), "/Developer", false, {"Failed to normalize true."}},
+      {Job("a", tool), std::nullopt, false, {"Invalid input."}},
   };
   for (const Case& c : cases) {
-    SCOPED_TRACE(c.why);
+    SCOPED_TRACE(Value(c.job).description() + " on " + std::string(c.mountPoint.value_or("(null)")));
     log::CaptureSink capture;
     EXPECT_EQ(Processor().verifyPlist(&c.job, c.mountPoint), c.verifies);
     EXPECT_EQ(capture.Texts(), c.logged);
@@ -65,46 +54,34 @@ TEST(PlistProcessor, VerifiesTheProgramAgainstTheRootOfTheMountPoint) {
 }
 
 TEST(PlistProcessor, RewritesFactoryJobsToTheRealMountPoint) {
-  const Dictionary invalidImage{{"ERROR", "INVALID IMAGE"}};
   const Dictionary service{{"Label", "s"}, {"VexaServiceName", "com.x"}};
-  const auto rewritten = [](Value args) {
-    return Dictionary{{"Label", "a"}, {"ProgramArguments", std::move(args)}};
-  };
+  const char* factory = "/private/var/factory_mount";
   struct Case {
-    const char* why;
     Dictionary job;
     std::string_view mountPoint;
     std::optional<Dictionary> result;
     Lines logged;
   } cases[] = {
-      {"agent", Job("a", Args({"/Developer/usr/libexec/agent", "-v"})), "/private/var/factory_mount",
-       rewritten(Args({"/var/factory_mount/usr/libexec/agent", "-v"})), {}},
-      {"/Developer alone, Program dropped", Dictionary{{"Label", "a"}, {"Program", "/Developer"}},
-       "/private/var/factory_mount", rewritten(Args({"/var/factory_mount"})), {}},
-      {"any first component", Job("a", Value("/DeveloperTools/x")), "/var/factory_mount",
-       rewritten(Args({"/var/factory_mount/x"})), {}},
-      {"personalized factory", Job("a", Args({"/Developer/x"})), "/private/var/personalized_factory/p",
-       rewritten(Args({"/var/personalized_factory/p/x"})), {}},
-      {"not a factory mount point", Job("a", Args({"/usr/bin/x"})), "/Developer",
-       Job("a", Args({"/usr/bin/x"})), {}},
-      {"service job passes", service, "/private/var/factory_mount", service,
-       {"Unexpected object: (null)", "Missing program arguments, likely a tethra plist."}},
-      {"no program", Dictionary{{"Label", "a"}}, "/private/var/factory_mount", std::nullopt,
-       {"Unexpected object: (null)", "Invalid program arguments"}},
-      {"first argument not text", Job("a", Args({Value::Int(1), "/Developer/x"})),
-       "/private/var/factory_mount", std::nullopt,
-       {"Invalid program arguments: " + Args({Value::Int(1), "/Developer/x"}).description()}},
-      {"program outside /Developer", Job("a", Args({"/usr/bin/x"})), "/private/var/factory_mount",
-       invalidImage, {"Invalid program path: /usr/bin/x"}},
+      {Job("a", Args({"/Developer/usr/libexec/agent", "-v"})), factory,
+       Job("a", Args({"/var/factory_mount/usr/libexec/agent", "-v"})), {}},
+      {Dictionary{{"Label", "a"}, {"Program", "/Developer"}}, factory, Job("a", Args({"/var/factory_mount"})), {}},
+      {Job("a", Value("/DeveloperTools/x")), "/var/factory_mount", Job("a", Args({"/var/factory_mount/x"})), {}},
+      {Job("a", Args({"/usr/bin/x"})), "/Developer", Job("a", Args({"/usr/bin/x"})), {}},
+      {service, factory, service, {"Unexpected object: (null)", "Missing program arguments, likely a tethra plist."}},
+      {Dictionary{{"Label", "a"}}, factory, std::nullopt, {"Unexpected object: (null)", "Invalid program arguments"}},
+      {Job("a", Args({Value::Int(1)})), factory, std::nullopt,
+       {"Invalid program arguments: " + Args({Value::Int(1)}).description()}},
+      {Job("a", Args({"/usr/bin/x"})), factory, Dictionary{{"ERROR", "INVALID IMAGE"}},
+       {"Invalid program path: /usr/bin/x"}},
   };
   for (const Case& c : cases) {
-    SCOPED_TRACE(c.why);
+    SCOPED_TRACE(Value(c.job).description() + " on " + std::string(c.mountPoint));
     log::CaptureSink capture;
     EXPECT_EQ(Processor().copyAndFixPlist(&c.job, c.mountPoint), c.result);
     EXPECT_EQ(capture.Texts(), c.logged);
   }
   log::CaptureSink capture;
-  EXPECT_EQ(Processor().copyAndFixPlist(nullptr, "/private/var/factory_mount"), std::nullopt);
+  EXPECT_EQ(Processor().copyAndFixPlist(nullptr, factory), std::nullopt);
   EXPECT_EQ(capture.Texts(), Lines{"invalid inputs"});
 }
 
@@ -114,14 +91,14 @@ TEST(PlistProcessor, ScanFindsJobListsAtAnyDepthAndNothingElse) {
   image.Write("jobs/a.plist", Value(Job("a", Args({"/x"}))), /*xml=*/true);
   image.Write("jobs/sub/.hidden", Value(Job("b", Args({"/x"}))));
   image.Write("jobs/array.plist", Args({"/x"}));
-  std::ofstream(image.root / "jobs/notes.txt") << "not a property list";
+  std::ofstream(image.root / "jobs/notes.txt") << "plain text";
   std::filesystem::create_directory_symlink(outside.root, image.root / "jobs/link");
   std::filesystem::create_symlink(outside.root / "escaped.plist", image.root / "jobs/file-link");
   ASSERT_EQ(::mkfifo((image.root / "jobs/fifo").c_str(), 0600), 0);
   std::filesystem::create_directory_symlink(image.root / "jobs", image.root / "jobs-link");
 
   ScopedServices services(Services{.os = &os::SystemOs()});
-  const auto labels = [&](const std::string& directory, bool goOn) {
+  const auto labels = [&](const char* directory, bool goOn) {
     std::multiset<std::string> seen;
     Processor().scanPlists((image.root / directory).string(), [&](const Dictionary& job) {
       seen.insert(*job.find("Label")->string());
@@ -131,7 +108,7 @@ TEST(PlistProcessor, ScanFindsJobListsAtAnyDepthAndNothingElse) {
   };
   EXPECT_EQ(labels("jobs", true), (std::multiset<std::string>{"a", "b"}));
   EXPECT_EQ(labels("jobs", false).size(), 1u);
-  EXPECT_TRUE(labels("jobs-link", true).empty());
+  EXPECT_TRUE(labels("jobs-link", true).empty());  // a link on the way is not followed either
   EXPECT_TRUE(labels("missing", true).empty());
 }
 
