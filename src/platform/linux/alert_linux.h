@@ -14,8 +14,8 @@ namespace brisvale::alert {
 
 struct LinuxAlertOptions {
   std::string agentSocketPath = kAlertAgentSocketPath;
-  // Prefixed to every preference file path; tests point it at a scratch directory.
-  std::string preferencesRoot;
+  // Prefixed to every preference file and bundle path; tests point it at a scratch root.
+  std::string root;
 };
 
 std::unique_ptr<UserAlertService> CreateLinuxUserAlertService(RunLoop& loop,

@@ -51,27 +51,24 @@ Answer AnswerReader::Feed(std::span<const uint8_t> bytes) {
   auto malformed = [this](std::string problem) {
     return Decide(Answer{Answer::State::Malformed, 0, std::move(problem)});
   };
-  while (!bytes.empty()) {
-    // Take only what the current frame still needs: the header, then the payload it
-    // announces once that announcement has been checked.
-    size_t wanted = kHeaderSize;
+  // Take only what the current frame still needs: the header, then the payload it
+  // announces once that announcement has been checked.
+  uint32_t length = 0;
+  for (;;) {
     if (frame_.size() >= kHeaderSize) {
-      uint32_t length = uint32_t{frame_[0]} << 24 | uint32_t{frame_[1]} << 16 |
-                        uint32_t{frame_[2]} << 8 | uint32_t{frame_[3]};
+      length = uint32_t{frame_[0]} << 24 | uint32_t{frame_[1]} << 16 |
+               uint32_t{frame_[2]} << 8 | uint32_t{frame_[3]};
       if (length == 0 || length > kMaxAnswerPayload) {
         return malformed("frame length " + std::to_string(length));
       }
-      wanted = kHeaderSize + length;
     }
+    size_t wanted = frame_.size() >= kHeaderSize ? kHeaderSize + length : kHeaderSize;
+    if (frame_.size() == wanted && length != 0) break;
+    if (bytes.empty()) return {};
     size_t take = std::min(wanted - frame_.size(), bytes.size());
     frame_.insert(frame_.end(), bytes.begin(), bytes.begin() + take);
     bytes = bytes.subspan(take);
-    if (frame_.size() == wanted && wanted > kHeaderSize) break;
   }
-  if (frame_.size() <= kHeaderSize) return {};
-  uint32_t length = uint32_t{frame_[0]} << 24 | uint32_t{frame_[1]} << 16 |
-                    uint32_t{frame_[2]} << 8 | uint32_t{frame_[3]};
-  if (frame_.size() < kHeaderSize + length) return {};
 
   std::string error;
   std::optional<plist::Value> body =

@@ -92,14 +92,15 @@ class LinuxUserAlertService final : public UserAlertService {
     std::optional<std::string> path = PreferenceFilePath(domain, user);
     if (!path) return std::nullopt;
     std::optional<plist::Value> preferences =
-        ReadPropertyListFile(AT_FDCWD, options_.preferencesRoot + *path);
+        ReadPropertyListFile(AT_FDCWD, options_.root + *path);
     const plist::Value* value = preferences ? preferences->get(key) : nullptr;
     if (!value) return std::nullopt;
     return *value;
   }
 
   std::unique_ptr<Bundle> OpenBundle(std::string_view path) override {
-    UniqueFd directory(open(std::string(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    UniqueFd directory(
+        open((options_.root + std::string(path)).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (!directory) return nullptr;
     return std::make_unique<DirectoryBundle>(std::move(directory));
   }
