@@ -1,5 +1,5 @@
 // Alerts through the real agent socket of a scratch root: shown, answered and cancelled
-// with `brisvalectl alert-agent`; no agent; agents that misbehave.
+// with `brisvalectl alert-agent`; agents that misbehave; no agent at all.
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/socket.h>
@@ -124,15 +124,8 @@ TEST_F(AlertAgentTest, ConsoleAgentShowsAnswersAndTakesDownAlerts) {
   EXPECT_TRUE(log.Lines().empty()) << log.Texts()[0];
 }
 
-TEST_F(AlertAgentTest, NoAgentListeningFailsTheAlert) {
-  CurrentServices().alerts = service.get();
-  ShowMountFailure(Medium());
-  EXPECT_EQ(log.Lines(), (std::vector<log::Line>{{Level::Default, "Failed to create user notification."}}));
-  EXPECT_FALSE(alerts.AlertIsUp());
-}
-
 // Each agent accepts the alert and then does one thing: says nothing, answers with
-// bytes that are not an answer, answers twice, or hangs up.
+// bytes that are not an answer, answers twice, or hangs up. Then no agent is left.
 TEST_F(AlertAgentTest, MisbehavingAgentsCannotHoldOrConfuseTheAlerts) {
   CurrentServices().alerts = service.get();
   const std::string answer = [] {
