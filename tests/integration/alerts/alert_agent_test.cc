@@ -80,6 +80,7 @@ struct AlertAgentTest : ::testing::Test {
     EXPECT_TRUE(alert::InstallLocalizationBundle(root, &error)) << error;
     service = alert::CreateLinuxUserAlertService(
         loop, {root + alert::kAlertAgentSocketPath, root});
+    CurrentServices().alerts = service.get();
   }
   ~AlertAgentTest() override { std::filesystem::remove_all(root); }
 
@@ -102,7 +103,6 @@ struct AlertAgentTest : ::testing::Test {
 };
 
 TEST_F(AlertAgentTest, ConsoleAgentShowsAnswersAndTakesDownAlerts) {
-  CurrentServices().alerts = service.get();
   AgentProcess agent(root);
   ASSERT_NE(agent.WaitFor(loop, "listening"), "(no listening line)");
 
@@ -127,7 +127,6 @@ TEST_F(AlertAgentTest, ConsoleAgentShowsAnswersAndTakesDownAlerts) {
 // Each agent accepts the alert and then does one thing: says nothing, answers with
 // bytes that are not an answer, answers twice, or hangs up. Then no agent is left.
 TEST_F(AlertAgentTest, MisbehavingAgentsCannotHoldOrConfuseTheAlerts) {
-  CurrentServices().alerts = service.get();
   const std::string answer = [] {
     plist::Bytes frame = alert::EncodeResponseFrame(0);
     return std::string(frame.begin(), frame.end());
