@@ -3,12 +3,14 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
 #include <filesystem>
+#include <fstream>
 
 #include "base/log.h"
 #include "base/runloop.h"
@@ -178,6 +180,29 @@ TEST_F(AlertAgentTest, MisbehavingAgentsCannotHoldOrConfuseTheAlerts) {
       ASSERT_TRUE(RunUntilAlertDown());
     }
   }
+}
+
+// Only a regular file is read: a link or a FIFO planted in its place reads as absent
+// (and the FIFO does not hold the daemon up).
+TEST_F(AlertAgentTest, PreferenceComesFromTheDomainFileOnly) {
+  const std::string directory = root + "/var/mobile/Library/Preferences";
+  const std::string file = directory + "/com.vantrel.mobile.device_o_matic.plist";
+  std::filesystem::create_directories(directory);
+  auto read = [&] {
+    return service->CopyPreference("DISABLE_DIALOGS", "com.vantrel.mobile.device_o_matic", "mobile");
+  };
+  EXPECT_EQ(read(), std::nullopt);
+  ASSERT_EQ(mkfifo(file.c_str(), 0644), 0);
+  EXPECT_EQ(read(), std::nullopt);
+  std::filesystem::remove(file);
+  const std::string real = root + "/elsewhere.plist";
+  std::ofstream(real) << plist::WriteXml(
+      plist::Dictionary{{"DISABLE_DIALOGS", plist::Value::Bool(true)}});
+  std::filesystem::create_symlink(real, file);
+  EXPECT_EQ(read(), std::nullopt);
+  std::filesystem::rename(real, file);
+  EXPECT_EQ(read(), plist::Value::Bool(true));
+  EXPECT_EQ(service->CopyPreference("DISABLE_DIALOGS", "../../../elsewhere", "mobile"), std::nullopt);
 }
 
 }  // namespace
