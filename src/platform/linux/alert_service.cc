@@ -65,7 +65,8 @@ class DirectoryBundle final : public Bundle {
     if (found == tables_.end()) {
       std::optional<plist::Value> table;
       if (IsPlainName(name)) {
-        table = ReadPropertyListFile(directory_.get(), "en.lproj/" + std::string(name) + ".strings");
+        table = ReadPropertyListFile(directory_.get(),
+                                     "en.lproj/" + std::string(name) + ".strings");
       }
       if (table && !table->dictionary()) table.reset();
       found = tables_.emplace(std::string(name), std::move(table)).first;
