@@ -95,8 +95,9 @@ int main(int argc, char** argv) {
     return 0;
   }
   if (options->root) {
-    if (!alert::InstallLocalizationBundle(*options->root, &error) ||
-        !linux_os::EnterSandboxRoot(*options->root, &error)) {
+    // Once inside, the root gets the localization bundle an installed system has.
+    if (!linux_os::EnterSandboxRoot(*options->root, &error) ||
+        !alert::InstallLocalizationBundle("", &error)) {
       std::fprintf(stderr, "brisvale-mounterd: cannot use %s as sandbox root: %s\n",
                    options->root->c_str(), error.c_str());
       return kExitSetup;
