@@ -20,6 +20,9 @@ class SystemNotify;
 namespace jobs {
 class JobLauncher;
 }
+namespace alert {
+class UserAlertService;
+}
 
 struct Services {
   registry::DeviceRegistry* registry = nullptr;
@@ -27,6 +30,7 @@ struct Services {
   ipc::IpcService* ipc = nullptr;
   notify::SystemNotify* notify = nullptr;
   jobs::JobLauncher* jobLauncher = nullptr;
+  alert::UserAlertService* alerts = nullptr;
 };
 
 inline Services& CurrentServices() {
