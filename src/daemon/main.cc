@@ -12,6 +12,7 @@
 #include "daemon/daemon.h"
 #include "daemon/matching_context.h"
 #include "daemon/stale_mount_points.h"
+#include "platform/linux/alert_linux.h"
 #include "platform/linux/ipc_linux.h"
 #include "platform/linux/notify_center.h"
 #include "platform/linux/os_sandbox.h"
@@ -94,7 +95,9 @@ int main(int argc, char** argv) {
     return 0;
   }
   if (options->root) {
-    if (!linux_os::EnterSandboxRoot(*options->root, &error)) {
+    // Once inside, the root gets the localization bundle an installed system has.
+    if (!linux_os::EnterSandboxRoot(*options->root, &error) ||
+        !alert::InstallLocalizationBundle("", &error)) {
       std::fprintf(stderr, "brisvale-mounterd: cannot use %s as sandbox root: %s\n",
                    options->root->c_str(), error.c_str());
       return kExitSetup;
@@ -119,7 +122,9 @@ int main(int argc, char** argv) {
   }
   std::unique_ptr<ipc::IpcService> ipc = CreateLinuxIpcService(loop, IpcOptions{});
   std::unique_ptr<notify::SystemNotify> notifier = notify::CreateLinuxSystemNotify();
-  ScopedServices services(Services{&registry, &os::SystemOs(), ipc.get(), notifier.get()});
+  std::unique_ptr<alert::UserAlertService> alerts = alert::CreateLinuxUserAlertService(loop);
+  ScopedServices services(
+      Services{&registry, &os::SystemOs(), ipc.get(), notifier.get(), alerts.get()});
 
   // Without the port no media or camera notification could ever arrive: a daemon that
   // cannot create it would serve requests but silently ignore hardware, so it stops.

@@ -17,12 +17,16 @@ class IpcService;
 namespace notify {
 class SystemNotify;
 }
+namespace alert {
+class UserAlertService;
+}
 
 struct Services {
   registry::DeviceRegistry* registry = nullptr;
   os::Os* os = nullptr;
   ipc::IpcService* ipc = nullptr;
   notify::SystemNotify* notify = nullptr;
+  alert::UserAlertService* alerts = nullptr;
 };
 
 inline Services& CurrentServices() {

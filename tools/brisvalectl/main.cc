@@ -1,6 +1,7 @@
 // brisvalectl: the command-line client of brisvale-mounterd.
 #include <algorithm>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <fstream>
 #include <iterator>
@@ -10,6 +11,7 @@
 #include <vector>
 
 #include "base/plist.h"
+#include "alert_agent.h"
 #include "json.h"
 #include "platform/linux/ipc_client.h"
 #include "platform/linux/notify_center.h"
@@ -32,6 +34,7 @@ constexpr int kTransportError = 4;  // cancelled, timed out or unreadable reply
 struct Options {
   std::string root;  // sandbox root of the daemon, "" for the real one
   bool json = false;
+  std::optional<int> autoDismissSeconds;  // alert-agent only
   std::vector<std::string> arguments;
 };
 
@@ -47,9 +50,12 @@ void PrintUsage(FILE* out) {
       "  sync PATH         flush the file system mounted at PATH to its device\n"
       "  watch             print system notifications as they arrive, until interrupted\n"
       "                    (with --json one JSON object a line)\n"
+      "  alert-agent       show user alerts and answer each when Enter is pressed\n"
+      "                    (with --json one JSON object a line)\n"
       "options:\n"
       "  --root DIR        talk to a daemon running in the sandbox root DIR\n"
       "  --json            print replies as JSON\n"
+      "  --auto-dismiss S  alert-agent: answer each alert after S seconds\n"
       "exit status: 0 success, 1 the daemon answered Failure, 2 usage, 3 daemon not\n"
       "running, 4 connection cancelled, timed out or unreadable reply\n",
       out);
@@ -253,6 +259,14 @@ int main(int argc, char** argv) {
     std::string arg = argv[i];
     if (arg == "--root" && i + 1 < argc) {
       options.root = argv[++i];
+    } else if (arg == "--auto-dismiss" && i + 1 < argc) {
+      char* end = nullptr;
+      long seconds = std::strtol(argv[++i], &end, 10);
+      if (*end != '\0' || seconds < 0 || seconds > 86400) {
+        std::fprintf(stderr, "brisvalectl: bad --auto-dismiss value %s\n", argv[i]);
+        return kUsage;
+      }
+      options.autoDismissSeconds = static_cast<int>(seconds);
     } else if (arg == "--json") {
       options.json = true;
     } else if (arg == "--help" || arg == "-h") {
@@ -278,6 +292,10 @@ int main(int argc, char** argv) {
   if (command == "unmount" && args.size() == 2) return MountPathRequest(options, "Unmount", args[1]);
   if (command == "sync" && args.size() == 2) return MountPathRequest(options, "Sync", args[1]);
   if (command == "watch" && args.size() == 1) return Watch(options);
+  if (command == "alert-agent" && args.size() == 1) {
+    return tools::RunAlertAgent(
+        {SocketPath(options, "alert-agent"), options.autoDismissSeconds, options.json});
+  }
   std::fprintf(stderr, "brisvalectl: bad command line\n");
   PrintUsage(stderr);
   return kUsage;
