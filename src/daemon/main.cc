@@ -16,6 +16,7 @@
 #include "platform/linux/ipc_linux.h"
 #include "platform/linux/notify_center.h"
 #include "platform/linux/os_sandbox.h"
+#include "platform/linux/registry_disk_images.h"
 #include "platform/os.h"
 #include "platform/services.h"
 #include "platform/system_devices.h"
@@ -94,6 +95,13 @@ int main(int argc, char** argv) {
     }
     return 0;
   }
+  // A daemon killed between attaching an image and mounting it left the loop device
+  // attached; nothing else would ever detach it. Done before entering the root, while
+  // the images' paths read as the kernel shows them.
+  if (char* root = ::realpath(options->root ? options->root->c_str() : "/", nullptr)) {
+    registry::DetachAbandonedImageDevices(root);
+    std::free(root);
+  }
   if (options->root) {
     // Once inside, the root gets the localization bundle an installed system has.
     if (!linux_os::EnterSandboxRoot(*options->root, &error) ||
@@ -111,6 +119,11 @@ int main(int argc, char** argv) {
   registry::RegistryModel registry;
   std::unique_ptr<registry::SystemDevices> systemDevices =
       registry::StartSystemDevices(registry, &loop, registry::SystemDevicesOptions{});
+  registry::DiskImageServicesOptions diskImageOptions;
+  diskImageOptions.rescanDevices = [&systemDevices] {
+    if (systemDevices) systemDevices->Rescan();
+  };
+  registry::DiskImageServices diskImages(registry, std::move(diskImageOptions));
   std::optional<registry::SimulatedDevices> simulatedDevices;
   if (options->devicesFile) {
     simulatedDevices.emplace(registry, *options->devicesFile);

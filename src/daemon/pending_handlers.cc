@@ -5,7 +5,7 @@
 
 namespace brisvale {
 
-void HandleMountRequest(MatchingContext&, const plist::Value&, plist::Dictionary&) {}
+void HandleMassStorageMount(const plist::Value&, plist::Dictionary&) {}
 
 void SubscribeMediaAttach(MatchingContext&) {}
 void SubscribeCameraAttach(MatchingContext&) {}

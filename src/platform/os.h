@@ -6,11 +6,14 @@
 // failure, so the core logs the error number without reading errno.
 #pragma once
 
+#include <cerrno>
 #include <cstddef>
 #include <cstdint>
 #include <functional>
+#include <memory>
 #include <span>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace brisvale::os {
@@ -63,10 +66,46 @@ struct TreeNode {
   bool mountPoint = false;
 };
 
+// A regular file found by ReadFilesBelow, read in full. Valid during the visit only.
+struct FoundFile {
+  std::string_view relativePath;  // from the directory the walk started at
+  std::span<const uint8_t> bytes;
+};
+
+// What lstat or fstat tells about a file.
+struct FileStatus {
+  uint32_t mode = 0;  // type bits (0xF000) and permissions
+  uint64_t device = 0;
+  uint64_t inode = 0;
+  uint64_t linkCount = 0;
+};
+inline constexpr uint32_t kFileTypeMask = 0xF000;
+inline constexpr uint32_t kFileTypeRegular = 0x8000;
+inline constexpr uint32_t kFileTypeDirectory = 0x4000;
+
 // How a tree walk ended: 0 when it ran to the end or the visitor stopped it.
 struct TreeWalk {
   int openError = 0;   // -errno when the walk could not start
   int closeError = 0;  // -errno when it could not be closed
+};
+
+// The arguments of an image volume mount, as the platform's HFS mount takes them.
+struct VolumeMountArguments {
+  std::string devicePath;
+  uint32_t ownerUid = 0;
+  uint32_t ownerGid = 0;
+  uint16_t permissionMask = 0777;
+  uint32_t textEncoding = 0xFFFFFFFF;  // none chosen
+};
+
+// Mount flags of MountVolume.
+inline constexpr uint32_t kMountUnion = 0x20;
+
+// A read-only mapping of a file; unmapped when destroyed.
+class FileMapping {
+ public:
+  virtual ~FileMapping() = default;
+  virtual std::span<const uint8_t> Bytes() const = 0;
 };
 
 class Os {
@@ -110,6 +149,50 @@ class Os {
   // another file system: a mount point inside the tree is visited but not descended
   // into. The visitor answers false to stop the walk.
   virtual TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) = 0;
+  // Reads every regular file at any depth below `directory`, hidden ones included, in
+  // directory order, going into a subdirectory as soon as it is met. Never follows a
+  // symbolic link (neither in `directory` itself nor below it), never leaves the file
+  // system `directory` is on, never opens anything in a way that could block. Files
+  // above `maxFileBytes` and everything that is not a regular file are passed over.
+  // The visitor answers false to stop. 0, or -errno when `directory` cannot be opened.
+  virtual int ReadFilesBelow(const char* /*directory*/, size_t /*maxFileBytes*/,
+                             const std::function<bool(const FoundFile&)>& /*visit*/) {
+    return -ENOSYS;
+  }
+
+  // The file at `path` itself, a link not followed.
+  virtual int StatPath(const char* /*path*/, FileStatus& /*status*/) { return -ENOSYS; }
+  virtual int StatDescriptor(int /*fd*/, FileStatus& /*status*/) { return -ENOSYS; }
+  virtual int MakeDirectory(const char* /*path*/, uint32_t /*mode*/) { return -ENOSYS; }
+  // Makes a new directory from `pathTemplate`, whose trailing "XXXXXX" characters are
+  // replaced in place.
+  virtual int MakeTemporaryDirectory(std::string& /*pathTemplate*/) { return -ENOSYS; }
+  virtual int ChangeMode(const char* /*path*/, uint32_t /*mode*/) { return -ENOSYS; }
+  // A read-only descriptor for the file at `path`, never through a link as its last
+  // component, owned by the caller.
+  virtual int OpenImageFile(const char* /*path*/) { return -ENOSYS; }
+  // A read lease on `fd` (opened read-only): refused while anyone has the file open for
+  // writing, and broken by anyone opening it for writing or truncating it later. It
+  // lasts until the descriptor is closed.
+  virtual int TakeReadLease(int /*fd*/) { return -ENOSYS; }
+  // False once the lease on `fd` has been broken, or was never held.
+  virtual bool HoldsReadLease(int /*fd*/) { return false; }
+
+  // Mounts the volume on `arguments.devicePath` at `mountPoint` with the platform's
+  // file-system `type` ("hfs") and flags (kMountReadOnly, kMountUnion).
+  virtual int MountVolume(const char* type, const char* mountPoint, uint32_t flags,
+                          const VolumeMountArguments& arguments) = 0;
+  // The text-encoding bias the file system `type` was loaded with.
+  virtual int EncodingBias(const char* type, int32_t& bias) = 0;
+  // The home directory of user `uid` in the user database.
+  virtual int UserHomeDirectory(uint32_t uid, std::string& home) = 0;
+  // At most `maxLength` bytes from the start of the file at `path`.
+  virtual int ReadFile(const char* path, size_t maxLength, std::vector<uint8_t>& contents) = 0;
+  // A read-only descriptor for the file at `path`, owned by the caller, or -errno.
+  virtual int OpenFile(const char* path) = 0;
+  virtual int FileSize(int fd, uint64_t& size) = 0;
+  // Maps the first `length` bytes of `fd` read-only and private.
+  virtual int MapFile(int fd, size_t length, std::unique_ptr<FileMapping>& mapping) = 0;
 };
 
 // The operating system this process runs on.

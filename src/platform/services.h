@@ -20,6 +20,9 @@ class SystemNotify;
 namespace alert {
 class UserAlertService;
 }
+namespace jobs {
+class JobLauncher;
+}
 
 struct Services {
   registry::DeviceRegistry* registry = nullptr;
@@ -27,6 +30,7 @@ struct Services {
   ipc::IpcService* ipc = nullptr;
   notify::SystemNotify* notify = nullptr;
   alert::UserAlertService* alerts = nullptr;
+  jobs::JobLauncher* jobLauncher = nullptr;
 };
 
 inline Services& CurrentServices() {

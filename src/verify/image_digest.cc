@@ -16,6 +16,36 @@ namespace {
 
 using FileDescriptor = UniqueFd;
 
+// Reads from offset 0 whatever the descriptor's position, so the caller's own
+// descriptor can be digested as it is.
+std::optional<plist::Bytes> DigestDescriptor(int fd, const std::string& pathText,
+                                             crypto::DigestAlgorithm algorithm) {
+  posix_fadvise(fd, 0, 0, POSIX_FADV_SEQUENTIAL);
+  crypto::Hasher hasher(algorithm);
+  std::unique_ptr<uint8_t[]> buffer(new (std::nothrow) uint8_t[kDigestReadSize]);
+  if (!buffer) {
+    Log(Level::Default, "Failed to allocate memory: %{errno}d", ENOMEM);
+    return std::nullopt;
+  }
+  for (off_t offset = 0;;) {
+    ssize_t count = pread(fd, buffer.get(), kDigestReadSize, offset);
+    if (count < 0 && errno == EINTR) continue;
+    if (count < 0) {
+      Log(Level::Default, "Failed to read %@: %{errno}d", pathText, errno);
+      return std::nullopt;
+    }
+    if (count == 0) break;
+    offset += count;
+    if (!hasher.Update({buffer.get(), static_cast<size_t>(count)})) break;
+  }
+  plist::Bytes digest(crypto::DigestLength(algorithm));
+  if (!hasher.Finish(digest)) {
+    Log(Level::Default, "Failed to compute the digest of %@.", pathText);
+    return std::nullopt;
+  }
+  return digest;
+}
+
 std::optional<plist::Bytes> DigestFile(std::string_view path, crypto::DigestAlgorithm algorithm) {
   if (path.empty()) {
     Log(Level::Default, "Invalid input.");
@@ -27,30 +57,14 @@ std::optional<plist::Bytes> DigestFile(std::string_view path, crypto::DigestAlgo
     Log(Level::Default, "Failed to create file handle for %@.", pathText);
     return std::nullopt;
   }
-  posix_fadvise(file.get(), 0, 0, POSIX_FADV_SEQUENTIAL);
+  return DigestDescriptor(file.get(), pathText, algorithm);
+}
 
-  crypto::Hasher hasher(algorithm);
-  std::unique_ptr<uint8_t[]> buffer(new (std::nothrow) uint8_t[kDigestReadSize]);
-  if (!buffer) {
-    Log(Level::Default, "Failed to allocate memory: %{errno}d", ENOMEM);
-    return std::nullopt;
-  }
-  for (;;) {
-    ssize_t count = read(file.get(), buffer.get(), kDigestReadSize);
-    if (count < 0 && errno == EINTR) continue;
-    if (count < 0) {
-      Log(Level::Default, "Failed to read %@: %{errno}d", pathText, errno);
-      return std::nullopt;
-    }
-    if (count == 0) break;
-    if (!hasher.Update({buffer.get(), static_cast<size_t>(count)})) break;
-  }
-  plist::Bytes digest(crypto::DigestLength(algorithm));
-  if (!hasher.Finish(digest)) {
-    Log(Level::Default, "Failed to compute the digest of %@.", pathText);
-    return std::nullopt;
-  }
-  return digest;
+std::optional<crypto::DigestAlgorithm> AlgorithmForLength(long length) {
+  if (length == static_cast<long>(crypto::kSha384Length)) return crypto::DigestAlgorithm::Sha384;
+  if (length == static_cast<long>(crypto::kSha1Length)) return crypto::DigestAlgorithm::Sha1;
+  Log(Level::Default, "Unsupported digest size: %ld", length);
+  return std::nullopt;
 }
 
 }  // namespace
@@ -68,14 +82,25 @@ int DigestImageFile(std::string_view path, std::vector<uint8_t>* digest, long le
     Log(Level::Default, "Invalid input");
     return -1;
   }
+  const std::optional<crypto::DigestAlgorithm> algorithm = AlgorithmForLength(length);
   std::optional<plist::Bytes> computed;
-  if (length == static_cast<long>(crypto::kSha384Length)) {
-    computed = DigestFileSha384(path);
-  } else if (length == static_cast<long>(crypto::kSha1Length)) {
-    computed = DigestFileSha1(path);
-  } else {
-    Log(Level::Default, "Unsupported digest size: %ld", length);
+  if (algorithm) computed = DigestFile(path, *algorithm);
+  if (!computed) {
+    Log(Level::Default, "Failed to digest data.");
+    return -1;
   }
+  *digest = std::move(*computed);
+  return 0;
+}
+
+int DigestImageDescriptor(int fd, std::string_view path, std::vector<uint8_t>* digest, long length) {
+  if (!digest || fd < 0) {
+    Log(Level::Default, "Invalid input");
+    return -1;
+  }
+  const std::optional<crypto::DigestAlgorithm> algorithm = AlgorithmForLength(length);
+  std::optional<plist::Bytes> computed;
+  if (algorithm) computed = DigestDescriptor(fd, std::string(path), *algorithm);
   if (!computed) {
     Log(Level::Default, "Failed to digest data.");
     return -1;

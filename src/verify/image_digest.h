@@ -19,6 +19,10 @@ inline constexpr size_t kDigestReadSize = 1 << 20;
 // 0 on success; -1 after logging why.
 int DigestImageFile(std::string_view path, std::vector<uint8_t>* digest, long length);
 
+// The same for a file already open for reading, read from its start; `path` only names
+// it in log lines.
+int DigestImageDescriptor(int fd, std::string_view path, std::vector<uint8_t>* digest, long length);
+
 // The 20-byte SHA-1 or 48-byte SHA-384 of the file's contents, or none after logging why.
 std::optional<plist::Bytes> DigestFileSha1(std::string_view path);
 std::optional<plist::Bytes> DigestFileSha384(std::string_view path);

@@ -13,6 +13,7 @@
 #include "base/plist.h"
 #include "alert_agent.h"
 #include "json.h"
+#include "mount_image.h"
 #include "platform/linux/ipc_client.h"
 #include "platform/linux/notify_center.h"
 
@@ -46,6 +47,10 @@ void PrintUsage(FILE* out) {
       "  raw FILE          send the request property list in FILE (XML or binary) and\n"
       "                    print the reply\n"
       "  post-event NAME   post NAME on the hardware event stream (root only)\n"
+      "  mount-image --type Developer|Factory|Personalized --signature FILE IMAGE [--consume]\n"
+      "                    verify and mount a disk image; prints the mount path. A copy\n"
+      "                    is staged inside the daemon's root unless --consume hands\n"
+      "                    IMAGE itself over (the daemon removes what it is given)\n"
       "  unmount PATH      take away the file system mounted at PATH\n"
       "  sync PATH         flush the file system mounted at PATH to its device\n"
       "  watch             print system notifications as they arrive, until interrupted\n"
@@ -57,7 +62,8 @@ void PrintUsage(FILE* out) {
       "  --json            print replies as JSON\n"
       "  --auto-dismiss S  alert-agent: answer each alert after S seconds\n"
       "exit status: 0 success, 1 the daemon answered Failure, 2 usage, 3 daemon not\n"
-      "running, 4 connection cancelled, timed out or unreadable reply\n",
+      "running, 4 connection cancelled, timed out or unreadable reply, 5 a local file\n"
+      "could not be read or staged\n",
       out);
 }
 
@@ -272,6 +278,9 @@ int main(int argc, char** argv) {
     } else if (arg == "--help" || arg == "-h") {
       PrintUsage(stdout);
       return kOk;
+    } else if (!options.arguments.empty() && options.arguments[0] == "mount-image" &&
+               (arg == "--type" || arg == "--signature" || arg == "--consume")) {
+      options.arguments.push_back(arg);  // the subcommand's own options
     } else if (arg.starts_with("--")) {
       std::fprintf(stderr, "brisvalectl: unknown option %s\n", arg.c_str());
       PrintUsage(stderr);
@@ -295,6 +304,10 @@ int main(int argc, char** argv) {
   if (command == "alert-agent" && args.size() == 1) {
     return tools::RunAlertAgent(
         {SocketPath(options, "alert-agent"), options.autoDismissSeconds, options.json});
+  }
+  if (command == "mount-image") {
+    return tools::MountImage({args.begin() + 1, args.end()}, options.root, options.json,
+                             [&options](const plist::Value& request) { return SendRequest(options, request); });
   }
   std::fprintf(stderr, "brisvalectl: bad command line\n");
   PrintUsage(stderr);

@@ -10,5 +10,6 @@ namespace brisvale::imgtool {
 int SignDeveloper(const std::vector<std::string>& args);
 int BuildManifest(const std::vector<std::string>& args);
 int WriteIdentity(const std::vector<std::string>& args);
+int BuildTrustCache(const std::vector<std::string>& args);
 
 }  // namespace brisvale::imgtool

@@ -41,6 +41,10 @@ constexpr const char* kUsage = R"(usage: brisvale-imgtool COMMAND [OPTIONS]
            [--production BOOL] [--security BOOL] [--hash-method TEXT]
            [--numbers] [--binary]
       A device-identity property list; --numbers writes the modes as 0/1 integers.
+
+  trust-cache DIR -o FILE
+      A trust cache holding the SHA-256 of every executable (a regular file with an
+      execute bit) below DIR, links not followed.
 )";
 
 }  // namespace
@@ -57,6 +61,7 @@ int main(int argc, char** argv) {
     if (command == "sign-developer") return SignDeveloper(args);
     if (command == "manifest") return BuildManifest(args);
     if (command == "identity") return WriteIdentity(args);
+    if (command == "trust-cache") return BuildTrustCache(args);
     throw ToolError("unknown command: " + command, true);
   } catch (const ToolError& error) {
     std::fprintf(stderr, "brisvale-imgtool: %s\n", error.what());

@@ -28,6 +28,25 @@ class LinuxOs final : public Os {
   int RealPath(const char* path, std::string& resolved) override;
   int ClearFlags(const char* path) override;
   TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) override;
+  // os_image_file.cc
+  int StatPath(const char* path, FileStatus& status) override;
+  int StatDescriptor(int fd, FileStatus& status) override;
+  int MakeDirectory(const char* path, uint32_t mode) override;
+  int MakeTemporaryDirectory(std::string& pathTemplate) override;
+  int ChangeMode(const char* path, uint32_t mode) override;
+  int OpenImageFile(const char* path) override;
+  int TakeReadLease(int fd) override;
+  bool HoldsReadLease(int fd) override;
+  // os_mount_volume.cc
+  int MountVolume(const char* type, const char* mountPoint, uint32_t flags,
+                  const VolumeMountArguments& arguments) override;
+  int EncodingBias(const char* type, int32_t& bias) override;
+  // os_files.cc
+  int UserHomeDirectory(uint32_t uid, std::string& home) override;
+  int ReadFile(const char* path, size_t maxLength, std::vector<uint8_t>& contents) override;
+  int OpenFile(const char* path) override;
+  int FileSize(int fd, uint64_t& size) override;
+  int MapFile(int fd, size_t length, std::unique_ptr<FileMapping>& mapping) override;
 
  private:
   UniqueFd mountInfo_;               // /proc/self/mountinfo, opened on first use

@@ -5,6 +5,8 @@
 #include <memory>
 #include <string>
 
+#include "platform/linux/loop_device.h"
+
 namespace brisvale::testing {
 
 // Builds a `sizeMiB` ext4 image at `imagePath` (holding a copy of `contentDir` when not
@@ -33,7 +35,7 @@ class LoopMount {
   std::string device_;
   std::string mountPoint_;
   std::string nodeCreated_;  // the node made under the device root, removed again
-  int loopFd_ = -1;
+  loop::LoopDevice loop_;
 };
 
 }  // namespace brisvale::testing

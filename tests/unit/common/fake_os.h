@@ -44,6 +44,15 @@ class FakeOs : public os::Os {
   os::TreeWalk WalkTree(const char*, const std::function<bool(const os::TreeNode&)>&) override {
     return {-ENOSYS, 0};
   }
+  int MountVolume(const char*, const char*, uint32_t, const os::VolumeMountArguments&) override {
+    return -ENOSYS;
+  }
+  int EncodingBias(const char*, int32_t&) override { return -ENOSYS; }
+  int UserHomeDirectory(uint32_t, std::string&) override { return -ENOSYS; }
+  int ReadFile(const char*, size_t, std::vector<uint8_t>&) override { return -ENOSYS; }
+  int OpenFile(const char*) override { return -ENOSYS; }
+  int FileSize(int, uint64_t&) override { return -ENOSYS; }
+  int MapFile(int, size_t, std::unique_ptr<os::FileMapping>&) override { return -ENOSYS; }
 };
 
 }  // namespace brisvale::testing
