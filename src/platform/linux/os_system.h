@@ -37,6 +37,9 @@ class LinuxOs final : public Os {
   int OpenImageFile(const char* path) override;
   int TakeReadLease(int fd) override;
   bool HoldsReadLease(int fd) override;
+  // os_spawn.cc
+  int SpawnProgram(const std::vector<std::string>& argv) override;
+  int WaitForChild(int pid, int& waitStatus) override;
   // os_mount_volume.cc
   int MountVolume(const char* type, const char* mountPoint, uint32_t flags,
                   const VolumeMountArguments& arguments) override;
