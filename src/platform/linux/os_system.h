@@ -2,7 +2,10 @@
 // calls is implemented in its own os_*.cc file.
 #pragma once
 
+#include <sys/types.h>
+
 #include <span>
+#include <string>
 #include <vector>
 
 #include "base/unique_fd.h"
@@ -56,6 +59,11 @@ class LinuxOs final : public Os {
   std::vector<MountRecord> table_;   // the last table parsed
   bool countedTable_ = false;        // table_ was parsed for a count
 };
+
+// True when `device`, or the disk it is a partition of, has a partition that is still
+// mounted (os_eject_rule.cc). Tests point the two paths at a tree of their own.
+bool DiskHasMountedPartition(dev_t device, const std::string& sysRoot = "/sys",
+                             const std::string& mountInfoPath = "/proc/self/mountinfo");
 
 // GetMountTable over a table in the kernel's mountinfo format at `path`.
 int ReadMountTable(const char* path, std::span<MountRecord> records);
