@@ -55,6 +55,8 @@ TEST(MassStorageMountTest, MountsByVolumeKindWithCheckerVerdicts) {
     ASSERT_TRUE(PlaceVolume(daemon, c.bsdName, c.kind, c.marker));
     sticks.push_back(Stick(c.bsdName));
   }
+  ASSERT_TRUE(PlaceVolume(daemon, "sdg1", "hfs+"));
+  sticks.push_back(Stick("sdg1"));
   std::ofstream(daemon.Path("/devices.plist"))
       << plist::WriteXml(plist::Dictionary{{"Objects", plist::Value(std::move(sticks))}});
   ASSERT_TRUE(InstallToolDoubles(daemon));
@@ -86,6 +88,14 @@ TEST(MassStorageMountTest, MountsByVolumeKindWithCheckerVerdicts) {
                                  &reply).ok());
   EXPECT_EQ(*reply->getString("Status"), "Failure");
   EXPECT_TRUE(daemon.LogContains("default: /dev/sdb1 is already mounted."));
+
+  // The client command: the path on success, status 1 on the daemon's Failure.
+  std::string output;
+  EXPECT_EQ(RunProgram({BRISVALE_CTL_PATH, "--root", daemon.root(), "mount-storage", "/dev/sdg1", "--read-only"},
+                       &output), 0);
+  EXPECT_EQ(output, "/private/var/mnt/mount3\n");
+  EXPECT_THAT(MountOptions(daemon.Path("/private/var/mnt/mount3"), "/dev/sdg1"), ::testing::StartsWith("tmpfs ro,"));
+  EXPECT_EQ(RunProgram({BRISVALE_CTL_PATH, "--root", daemon.root(), "mount-storage", "/dev/sde1"}), 1);
 }
 
 }  // namespace
