@@ -5,6 +5,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <cstdlib>
 #include <set>
 
@@ -194,6 +197,26 @@ TEST_F(MassStorageTest, RequestValidatesNodeAndReadsReadOnlyAsBooleanOnly) {
   EXPECT_TRUE(capture.Contains(log::Level::Default, "/dev/sdb1 is already mounted."));
   EXPECT_TRUE(os.spawned.empty());
   EXPECT_EQ(reply.find("MountPath"), nullptr);
+}
+
+// Nodes that are not media, on the real system: each ends with its line, nothing hangs.
+TEST(MassStorageNodeTest, FifoDirectoryAndMissingNodeFailWithTheirLine) {
+  ScopedServices services(Services{nullptr, &os::SystemOs()});
+  const std::string dir = ::testing::TempDir() + "nodes-" + std::to_string(getpid());
+  ASSERT_EQ(mkdir(dir.c_str(), 0700), 0);
+  ASSERT_EQ(mkfifo((dir + "/fifo").c_str(), 0600), 0);
+  struct Case { std::string node, line; };
+  for (const Case& c : {Case{dir + "/fifo", "Failed to read " + dir + "/fifo volume header: 29"},
+                        Case{dir, "Failed to read " + dir + " volume header: 21"},
+                        Case{dir + "/gone", "Failed to open " + dir + "/gone: 2"}}) {
+    log::CaptureSink capture;
+    bool verificationFailed = false, mountFailed = false;
+    EXPECT_EQ(MountMassStorageDevice(c.node, false, verificationFailed, mountFailed), std::nullopt);
+    EXPECT_TRUE(mountFailed);
+    EXPECT_EQ(capture.Texts().front(), c.line);
+  }
+  unlink((dir + "/fifo").c_str());
+  rmdir(dir.c_str());
 }
 
 // The real spawn and wait: exit statuses pass through, a signal and a missing tool are -1.
