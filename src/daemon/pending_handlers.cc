@@ -5,8 +5,6 @@
 
 namespace brisvale {
 
-void HandleMassStorageMount(const plist::Value&, plist::Dictionary&) {}
-
 void SubscribeMediaAttach(MatchingContext&) {}
 void SubscribeCameraAttach(MatchingContext&) {}
 void HandleMediaDetached() {}
