@@ -139,7 +139,7 @@ int main(int argc, char** argv) {
   jobs::SpoolJobLauncher jobLauncher;
   std::unique_ptr<alert::UserAlertService> alerts = alert::CreateLinuxUserAlertService(loop);
   ScopedServices services(Services{&registry, &os::SystemOs(), ipc.get(), notifier.get(),
-                                   &jobLauncher, alerts.get()});
+                                   alerts.get(), &jobLauncher});
 
   // Without the port no media or camera notification could ever arrive: a daemon that
   // cannot create it would serve requests but silently ignore hardware, so it stops.

@@ -29,8 +29,8 @@ struct Services {
   os::Os* os = nullptr;
   ipc::IpcService* ipc = nullptr;
   notify::SystemNotify* notify = nullptr;
-  jobs::JobLauncher* jobLauncher = nullptr;
   alert::UserAlertService* alerts = nullptr;
+  jobs::JobLauncher* jobLauncher = nullptr;
 };
 
 inline Services& CurrentServices() {
