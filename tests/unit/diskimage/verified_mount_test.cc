@@ -1,10 +1,9 @@
-// The verified mount pipeline and the mount request over fakes: which step ends an
+// The verified mount pipeline and the attach over fakes: which step ends an
 // attempt, its exact line, what is undone, and that the staged file is always consumed.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include "base/log.h"
-#include "daemon/request_handlers.h"
 #include "diskimage/attach.h"
 #include "diskimage/verified_mount.h"
 #include "file_tree_os.h"
@@ -147,20 +146,6 @@ TEST_F(VerifiedMountTest, DigestComesFromTheVerifiedDescriptorAndFindsAnIdentica
   EXPECT_FALSE(Mount("Personalized", "/private/var/personalized_debug", ManifestWithDigestLength(32)).imageDigest);
   EXPECT_THAT(DefaultLines(), ElementsAre("Unsupported digest size: 32", "Failed to digest data.",
                                           "Failed to digest /private/var/stage/image.img."));
-}
-
-TEST_F(VerifiedMountTest, MountRequestRefusesASecondImageAtTheSamePlace) {
-  MountImageAt("/Developer", "loop4");
-  os.AddFile(kImage, kFile);
-  MatchingContext context;
-  plist::Dictionary reply{{"Status", "Failure"}};
-  HandleMountRequest(context,
-                     plist::Value(plist::Dictionary{{"DeviceType", "DiskImage"}, {"DiskImageType", "Developer"},
-                                                    {"ImageSignature", plist::Bytes{1}}, {"DiskImagePath", kImage}}),
-                     reply);
-  EXPECT_EQ(reply, (plist::Dictionary{{"Status", "Failure"}}));
-  EXPECT_THAT(DefaultLines(), ElementsAre("A disk image of type Developer/(null) is already mounted at /Developer."));
-  EXPECT_TRUE(os.files.contains(kImage));  // refused before the file is consumed
 }
 
 // A controller that attaches whatever it is asked to and publishes its media at once.
