@@ -2,6 +2,7 @@
 // sticks and the check and mount tool doubles.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <filesystem>
 #include <fstream>
@@ -47,11 +48,14 @@ TEST(MassStorageMountTest, MountsByVolumeKindWithCheckerVerdicts) {
       {"sdd1", "hfs+", "broken", false, "", "default: Failed to mount /dev/sdd1: verification issues"},
       {"sde1", "ntfs", "", false, "", "default: Failed to mount /dev/sde1."},
       {"sdf1", "fat", "", false, "/dev/sdf1", "debug: MSDOS FAT filesystem at /dev/sdf1. Skipping mount."},
+      // A FIFO where the node should be must not block the daemon.
+      {"sdh1", "fifo", "", false, "", "default: Failed to read /dev/sdh1 volume header: 29"},
   };
   SandboxDaemon daemon;
   plist::Array sticks;
   for (const Case& c : cases) {
-    ASSERT_TRUE(PlaceVolume(daemon, c.bsdName, c.kind, c.marker));
+    ASSERT_TRUE(c.kind == "fifo" ? mkfifo(daemon.Path("/dev/" + c.bsdName).c_str(), 0600) == 0
+                                 : PlaceVolume(daemon, c.bsdName, c.kind, c.marker));
     sticks.push_back(Stick(c.bsdName));
   }
   ASSERT_TRUE(PlaceVolume(daemon, "sdg1", "hfs+"));
