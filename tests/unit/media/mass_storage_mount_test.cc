@@ -23,13 +23,12 @@ using ::testing::ElementsAre;
 using Argv = std::vector<std::string>;
 
 constexpr int kSpawnMissing = -1000;  // a tool answer meaning "the program is not there"
-constexpr int kKilled = 1001;         // a tool answer meaning "ended by SIGKILL"
 
 // Paths, spawned tools and mounts: mount_hfs mounts at the canonical /private/var path.
 struct ToolOs : testing::FakeOs {
   std::set<std::string> existing{"/var/mnt"};
   std::vector<Argv> spawned;
-  std::map<std::string, int> answers;  // "fsck_hfs -q" -> exit status or a marker above
+  std::map<std::string, int> answers;  // "fsck_hfs -q" -> exit status, or kSpawnMissing
   int lastAnswer = 0;
 
   int StatPath(const char* path, os::FileStatus&) override { return existing.count(path) ? 0 : -ENOENT; }
@@ -52,7 +51,7 @@ struct ToolOs : testing::FakeOs {
     return 4242;
   }
   int WaitForChild(int, int& waitStatus) override {
-    waitStatus = lastAnswer == kKilled ? 9 : lastAnswer << 8;
+    waitStatus = lastAnswer << 8;
     return 0;
   }
 };
