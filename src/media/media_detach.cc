@@ -51,9 +51,13 @@ void UnmountIfGone(const std::string& node, const plist::Value& value) {
 
 }  // namespace
 
+void UnmountPulledMedia(const plist::Dictionary& mounted) {
+  for (const auto& [node, entry] : mounted) UnmountIfGone(node, entry);
+}
+
 void HandleMediaDetached() {
   if (const std::optional<DeviceMap> mounted = CopyMountedFilesystemMap()) {
-    for (const auto& [node, entry] : *mounted) UnmountIfGone(node, entry);
+    UnmountPulledMedia(*mounted);
   } else {
     Log(Level::Debug, "No mounted devices, just posting notification.");
   }

@@ -5,8 +5,13 @@
 // that clients read the device list again.
 #pragma once
 
+#include "base/plist.h"
+
 namespace brisvale {
 
 void HandleMediaDetached();
+
+// The unmount half over a given map of mounted file systems keyed by device node.
+void UnmountPulledMedia(const plist::Dictionary& mounted);
 
 }  // namespace brisvale
