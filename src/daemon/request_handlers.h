@@ -13,8 +13,6 @@ namespace brisvale {
 
 void HandleMountRequest(MatchingContext& context, const plist::Value& request,
                         plist::Dictionary& reply);
-// Removable media are mounted by their own subsystem, which is not built yet.
-void HandleMassStorageMount(const plist::Value& request, plist::Dictionary& reply);
 void HandleUnmount(const plist::Value& request, plist::Dictionary& reply);
 void HandleSync(const plist::Value& request, plist::Dictionary& reply);
 

@@ -7,6 +7,7 @@
 #include "diskimage/verified_mount.h"
 #include "inventory/inventory.h"
 #include "jobs/image_jobs.h"
+#include "media/mass_storage_mount.h"
 #include "platform/os.h"
 #include "platform/services.h"
 #include "platform/system_notify.h"

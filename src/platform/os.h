@@ -178,6 +178,14 @@ class Os {
   // False once the lease on `fd` has been broken, or was never held.
   virtual bool HoldsReadLease(int /*fd*/) { return false; }
 
+  // Starts the program at the absolute path argv[0] with `argv` and an empty
+  // environment; the child inherits every descriptor. The child's process id, or -errno
+  // when it could not be started (a missing program included).
+  virtual int SpawnProgram(const std::vector<std::string>& /*argv*/) { return -ENOSYS; }
+  // Blocks until child `pid` ends, however long that takes, and gives its raw wait
+  // status (exit code in bits 8-15 when the low 7 bits are 0). 0 or -errno.
+  virtual int WaitForChild(int /*pid*/, int& /*waitStatus*/) { return -ENOSYS; }
+
   // Mounts the volume on `arguments.devicePath` at `mountPoint` with the platform's
   // file-system `type` ("hfs") and flags (kMountReadOnly, kMountUnion).
   virtual int MountVolume(const char* type, const char* mountPoint, uint32_t flags,

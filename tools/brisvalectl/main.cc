@@ -14,6 +14,7 @@
 #include "alert_agent.h"
 #include "json.h"
 #include "mount_image.h"
+#include "mount_storage.h"
 #include "platform/linux/ipc_client.h"
 #include "platform/linux/notify_center.h"
 
@@ -51,6 +52,9 @@ void PrintUsage(FILE* out) {
       "                    verify and mount a disk image; prints the mount path. A copy\n"
       "                    is staged inside the daemon's root unless --consume hands\n"
       "                    IMAGE itself over (the daemon removes what it is given)\n"
+      "  mount-storage NODE [--read-only]\n"
+      "                    check and mount the attached removable medium NODE (such\n"
+      "                    as /dev/sdb1); prints the mount path\n"
       "  unmount PATH      take away the file system mounted at PATH\n"
       "  sync PATH         flush the file system mounted at PATH to its device\n"
       "  watch             print system notifications as they arrive, until interrupted\n"
@@ -281,6 +285,8 @@ int main(int argc, char** argv) {
     } else if (!options.arguments.empty() && options.arguments[0] == "mount-image" &&
                (arg == "--type" || arg == "--signature" || arg == "--consume")) {
       options.arguments.push_back(arg);  // the subcommand's own options
+    } else if (!options.arguments.empty() && options.arguments[0] == "mount-storage" && arg == "--read-only") {
+      options.arguments.push_back(arg);
     } else if (arg.starts_with("--")) {
       std::fprintf(stderr, "brisvalectl: unknown option %s\n", arg.c_str());
       PrintUsage(stderr);
@@ -308,6 +314,10 @@ int main(int argc, char** argv) {
   if (command == "mount-image") {
     return tools::MountImage({args.begin() + 1, args.end()}, options.root, options.json,
                              [&options](const plist::Value& request) { return SendRequest(options, request); });
+  }
+  if (command == "mount-storage") {
+    return tools::MountStorage({args.begin() + 1, args.end()}, options.json,
+                               [&options](const plist::Value& request) { return SendRequest(options, request); });
   }
   std::fprintf(stderr, "brisvalectl: bad command line\n");
   PrintUsage(stderr);

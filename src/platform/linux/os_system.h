@@ -2,7 +2,10 @@
 // calls is implemented in its own os_*.cc file.
 #pragma once
 
+#include <sys/types.h>
+
 #include <span>
+#include <string>
 #include <vector>
 
 #include "base/unique_fd.h"
@@ -37,6 +40,9 @@ class LinuxOs final : public Os {
   int OpenImageFile(const char* path) override;
   int TakeReadLease(int fd) override;
   bool HoldsReadLease(int fd) override;
+  // os_spawn.cc
+  int SpawnProgram(const std::vector<std::string>& argv) override;
+  int WaitForChild(int pid, int& waitStatus) override;
   // os_mount_volume.cc
   int MountVolume(const char* type, const char* mountPoint, uint32_t flags,
                   const VolumeMountArguments& arguments) override;
@@ -53,6 +59,11 @@ class LinuxOs final : public Os {
   std::vector<MountRecord> table_;   // the last table parsed
   bool countedTable_ = false;        // table_ was parsed for a count
 };
+
+// True when `device`, or the disk it is a partition of, has a partition that is still
+// mounted (os_eject_rule.cc). Tests point the two paths at a tree of their own.
+bool DiskHasMountedPartition(dev_t device, const std::string& sysRoot = "/sys",
+                             const std::string& mountInfoPath = "/proc/self/mountinfo");
 
 // GetMountTable over a table in the kernel's mountinfo format at `path`.
 int ReadMountTable(const char* path, std::span<MountRecord> records);

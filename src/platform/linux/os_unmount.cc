@@ -54,6 +54,8 @@ int LinuxOs::EjectDevice(int fd) {
   if (::fstat(fd, &status) != 0) return -errno;
   if (!S_ISBLK(status.st_mode)) return -ENOTBLK;
   if (major(status.st_rdev) == kLoopMajor) return Status(::ioctl(fd, LOOP_CLR_FD));
+  // Ejecting one partition would take the whole disk, siblings and all.
+  if (DiskHasMountedPartition(status.st_rdev)) return -EBUSY;
   return Status(::ioctl(fd, CDROMEJECT));
 }
 

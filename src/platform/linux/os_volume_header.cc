@@ -11,7 +11,9 @@
 namespace brisvale::os {
 
 VolumeHeaderRead LinuxOs::ReadVolumeHeader(const char* devicePath, VolumeHeaderSpan header) {
-  const UniqueFd fd(::open(devicePath, O_RDONLY | O_CLOEXEC));
+  // A FIFO placed where a medium's node should be must not block the daemon's only
+  // thread in open(); its read then fails like that of any other non-medium.
+  const UniqueFd fd(::open(devicePath, O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
   if (!fd) return {VolumeHeaderRead::Outcome::OpenFailed, errno};
   // One call and no retry: a short read means the node is not a whole medium. A short
   // read sets no error number, so clear it to report 0 rather than a stale one.
