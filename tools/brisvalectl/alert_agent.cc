@@ -8,6 +8,7 @@
 #include <chrono>
 #include <cstdio>
 #include <list>
+#include <utility>
 
 #include "base/plist.h"
 #include "base/unique_fd.h"
@@ -149,8 +150,9 @@ class Agent {
       return value && value->string() ? *value->string() : std::string();
     };
     plist::Dictionary fields;
-    for (const char* key : {"Title", "Message", "DefaultButtonTitle"}) {
-      if (const plist::Value* value = frame.find(key)) fields.set(key, *value);
+    for (auto [key, name] : {std::pair{"Title", "title"}, std::pair{"Message", "message"},
+                             std::pair{"DefaultButtonTitle", "button"}}) {
+      if (const plist::Value* value = frame.find(key)) fields.set(name, *value);
     }
     std::string button = text("DefaultButtonTitle").empty() ? "OK" : text("DefaultButtonTitle");
     Print("shown", alert.number, fields,

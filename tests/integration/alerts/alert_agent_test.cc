@@ -110,8 +110,8 @@ TEST_F(AlertAgentTest, ConsoleAgentShowsAnswersAndTakesDownAlerts) {
 
   ShowMountFailure(Medium());
   std::string shown = agent.WaitFor(loop, "shown");
-  EXPECT_NE(shown.find("\"Title\": \"Cannot Use Storage Device\""), std::string::npos) << shown;
-  EXPECT_NE(shown.find("\"DefaultButtonTitle\": \"OK\""), std::string::npos) << shown;
+  EXPECT_NE(shown.find("\"title\": \"Cannot Use Storage Device\""), std::string::npos) << shown;
+  EXPECT_NE(shown.find("\"button\": \"OK\""), std::string::npos) << shown;
   agent.PressEnter();
   EXPECT_TRUE(RunUntilAlertDown());
   EXPECT_FALSE(alerts.WatchesMedia());

@@ -2,9 +2,6 @@
 // shown, what is dropped, what takes an alert down, and the exact lines on the way.
 #include <gtest/gtest.h>
 
-#include <atomic>
-#include <thread>
-
 #include "base/log.h"
 #include "base/runloop.h"
 #include "media/user_alerts.h"
@@ -64,7 +61,7 @@ struct FakeAlertService final : alert::UserAlertService {
   std::optional<plist::Value> preference;
   bool noBundle = false, noAgent = false, noSource = false;
   long cancelStatus = 0;
-  std::atomic<int> preferenceReads = 0;
+  int preferenceReads = 0;
   std::vector<Description> shown;
   Alert* current = nullptr;
   int liveAlerts = 0, cancels = 0;
@@ -140,18 +137,6 @@ TEST_F(UserAlertsTest, OnlyABooleanPreferenceSwitchesAlertsOff) {
     EXPECT_EQ(fake.preferenceReads, 1);
     EXPECT_EQ(log.Texts(), c.lines);
   }
-}
-
-TEST_F(UserAlertsTest, PreferenceIsReadOnceWhenManyThreadsAskFirst) {
-  service.preference = plist::Value::Bool(true);
-  std::vector<std::thread> threads;
-  for (int i = 0; i < 8; ++i) {
-    threads.emplace_back([this] { alerts.Show("MOUNT_FAILURE_TITLE", nullptr, nullptr, nullptr); });
-  }
-  for (auto& thread : threads) thread.join();
-  EXPECT_EQ(service.preferenceReads, 1);
-  Drain();
-  EXPECT_TRUE(service.shown.empty());
 }
 
 TEST_F(UserAlertsTest, FailuresShowNothingAndLeaveNoAlert) {
