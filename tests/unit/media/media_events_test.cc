@@ -64,43 +64,6 @@ class DetachOs : public testing::FakeOs {
   std::string busy;
 };
 
-// Lets the test make adding a matching notification fail.
-class FailableRegistry : public registry::DeviceRegistry {
- public:
-  explicit FailableRegistry(registry::RegistryModel& model) : model_(model) {}
-  registry::Status failAdd = registry::kSuccess;
-
-  registry::Result<std::unique_ptr<registry::Iterator>> GetMatchingServices(
-      const registry::Matching& matching) override {
-    return model_.GetMatchingServices(matching);
-  }
-  registry::ObjectRef GetMatchingService(const registry::Matching& matching) override {
-    return model_.GetMatchingService(matching);
-  }
-  registry::Result<std::unique_ptr<registry::NotificationPort>> CreateNotificationPort() override {
-    return model_.CreateNotificationPort();
-  }
-  registry::Result<std::unique_ptr<registry::Iterator>> AddMatchingNotification(
-      registry::NotificationPort& port, registry::MatchKind kind, const registry::Matching& matching,
-      registry::MatchHandler handler) override {
-    if (failAdd != registry::kSuccess) return {failAdd, nullptr};
-    return model_.AddMatchingNotification(port, kind, matching, std::move(handler));
-  }
-  registry::Result<std::unique_ptr<registry::Notification>> AddInterestNotification(
-      registry::NotificationPort& port, const registry::ObjectRef& object,
-      registry::InterestHandler handler) override {
-    return model_.AddInterestNotification(port, object, std::move(handler));
-  }
-  registry::Result<std::unique_ptr<registry::UserClient>> Open(const registry::ObjectRef& service,
-                                                              uint32_t type) override {
-    return model_.Open(service, type);
-  }
-  void Refresh(registry::RefreshReason reason) override { model_.Refresh(reason); }
-
- private:
-  registry::RegistryModel& model_;
-};
-
 class OneObject : public registry::Iterator {
  public:
   explicit OneObject(registry::ObjectRef object) : object_(std::move(object)) {}
@@ -128,7 +91,7 @@ plist::Dictionary With(plist::Dictionary properties, std::string key, std::optio
 
 class MediaEventsTest : public ::testing::Test {
  protected:
-  MediaEventsTest() : services_(Services{&registry, &os, &ipc, &notifier}) {
+  MediaEventsTest() : services_(Services{&model, &os, &ipc, &notifier}) {
     log::SetDebugEnabled(true);
     usbDisk = model.Publish(nullptr, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}});
     internal = model.Publish(nullptr, "KxAHCIDevice", {});
@@ -168,7 +131,6 @@ class MediaEventsTest : public ::testing::Test {
 
   RunLoop loop;
   registry::RegistryModel model;
-  FailableRegistry registry{model};
   DetachOs os;
   CountingIpc ipc;
   RecordingNotify notifier;
@@ -276,12 +238,12 @@ TEST_F(MediaEventsTest, EachAttachEventReplacesTheSubscriptionAndSkipsMountedMed
   const auto texts = capture.Texts();
   EXPECT_EQ(std::count(texts.begin(), texts.end(), "Inspecting the attached media."), 1);
 
-  // A failed subscription logs and keeps the live one.
+  // A subscription that cannot be added logs and keeps the live one.
   const registry::Iterator* live = context.mediaIterator.get();
-  registry.failAdd = registry::kNoResources;
+  auto port = std::move(context.notificationPort);
   SubscribeMediaAttach(context);
   EXPECT_EQ(context.mediaIterator.get(), live);
-  EXPECT_TRUE(capture.Contains(Level::Default, "KxServiceAddMatchingNotification failed: 02be"));
+  EXPECT_TRUE(capture.Contains(Level::Default, "KxServiceAddMatchingNotification failed: 02bc"));
 }
 
 TEST_F(MediaEventsTest, EverySubscriptionKeepsTheProcessAliveForItsInterval) {
@@ -289,7 +251,7 @@ TEST_F(MediaEventsTest, EverySubscriptionKeepsTheProcessAliveForItsInterval) {
   context.backgroundQueue = &queue;
   context.keepAlive = 100ms;
   SubscribeCameraAttach(context);
-  registry.failAdd = registry::kError;  // a failed attempt holds one too
+  context.notificationPort.reset();  // a failed attempt holds one too
   SubscribeMediaAttach(context);
   EXPECT_EQ(ipc.count, 2);
   for (int i = 0; i < 400 && ipc.count != 0; ++i) std::this_thread::sleep_for(5ms);
