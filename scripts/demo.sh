@@ -61,24 +61,67 @@ done
 # The stick's node holds a FAT boot sector; it is listed, never mounted.
 { printf '\xeb\x3c\x90MSDOS5.0'; head -c 4096 /dev/zero; } >"$sandbox/dev/sdz1"
 
-# A developer image on a loop device at /Developer; the two directories above the
-# image file hold the halves of its signature's hex text.
-image_dir="$sandbox/private/var/run/images/AB12CD/34EF56"
-mkdir -p "$image_dir" "$sandbox/Developer"
-mkfs.ext4 -q -O ^has_journal "$image_dir/image.img" 4M
-loop=$(losetup --find --show --read-only "$image_dir/image.img")
-[[ -e "$sandbox$loop" ]] || mknod "$sandbox$loop" b 7 "${loop#/dev/loop}"
-mount -o ro "$loop" "$sandbox/Developer"
+# What a device carries for verified disk images: the developer signing certificate
+# and its CA, the running system's version, and the device identity a personalized
+# manifest is issued for.
+imgtool=build/tools/imgtool/brisvale-imgtool
+pki=tests/pki
+work=$(mktemp -d /tmp/brisvale-demo-images.XXXXXX)
+mkdir -p "$sandbox/System/Library/Tethra" "$sandbox/System/Library/Basalt" "$sandbox/Developer"
+cp "$pki/developer-signing.pem" "$sandbox/System/Library/Tethra/CorvexDebug.pem"
+cp "$pki/developer-ca.pem" "$sandbox/System/Library/Tethra/CorvexCA.pem"
+version_plist() {
+  printf '<?xml version="1.0" encoding="UTF-8"?>\n<plist version="1.0"><dict><key>ProductVersion</key><string>%s</string></dict></plist>\n' "$1"
+}
+version_plist 21.4.1 >"$sandbox/System/Library/Basalt/SystemVersion.plist"
+device=(--nonce 00112233445566778899aabbccddeeff --board 8 --chip 0x8030 --ecid 0x1122334455667788
+        --production true --security true)
+"$imgtool" identity -o "$sandbox/private/var/run/vexa/device-identity.plist" "${device[@]}" --hash-method sha384
+
+# A developer image: an ext4 volume with the version file, a tool, one job that runs
+# it, and a trust cache of its executables; signed over its SHA-1 digest.
+content="$work/developer"
+mkdir -p "$content/System/Library/Basalt" "$content/usr/bin" "$content/Library/OrbitDaemons"
+version_plist 21.4.5 >"$content/System/Library/Basalt/SystemVersion.plist"
+printf '#!/bin/sh\necho "hello from the developer image"\n' >"$content/usr/bin/hello"
+chmod 755 "$content/usr/bin/hello"
+cat >"$content/Library/OrbitDaemons/com.vantrel.demo.hello.plist" <<'PLIST'
+<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><dict>
+  <key>Label</key><string>com.vantrel.demo.hello</string>
+  <key>ProgramArguments</key><array><string>/Developer/usr/bin/hello</string></array>
+</dict></plist>
+PLIST
+"$imgtool" trust-cache "$content" -o "$content/.TrustCache"
+mkfs.ext4 -q -O ^has_journal -d "$content" "$work/developer.img" 8M
+"$imgtool" sign-developer --key "$pki/developer-signing.key" --image "$work/developer.img" -o "$work/developer.sig"
+# Notifications as they arrive: the mounts announced, then taken away again.
+"$ctl" --root "$sandbox" watch >"$sandbox.watch" 2>&1 &
+watch_pid=$!
+sleep 0.2
+step "$ctl" --root "$sandbox" mount-image --type Developer --signature "$work/developer.sig" "$work/developer.img"
+step "$ctl" --root "$sandbox" jobs
+
+# A personalized debug image with a manifest issued for this device: no version check.
+content="$work/debug"
+mkdir -p "$content/usr/bin"
+printf '#!/bin/sh\necho debug\n' >"$content/usr/bin/debug"
+chmod 755 "$content/usr/bin/debug"
+"$imgtool" trust-cache "$content" -o "$content/.TrustCache"
+mkfs.ext4 -q -O ^has_journal -d "$content" "$work/debug.img" 4M
+"$imgtool" manifest --image "$work/debug.img" -o "$work/debug.manifest" --sub-type DebugDiskImage "${device[@]}"
+step "$ctl" --root "$sandbox" --json mount-image --type Personalized --signature "$work/debug.manifest" "$work/debug.img"
+# The same manifest on another image is refused, and the image is consumed all the same.
+cp "$work/developer.img" "$work/other.img"
+step "$ctl" --root "$sandbox" mount-image --type Personalized --signature "$work/debug.manifest" "$work/other.img"
+rm -rf "$work"
 
 step "$ctl" --root "$sandbox" list
 step "$ctl" --root "$sandbox" list --json
 
-# Notifications as they arrive, while the image is flushed and taken away again.
-"$ctl" --root "$sandbox" watch >"$sandbox.watch" 2>&1 &
-watch_pid=$!
-sleep 0.2
 step "$ctl" --root "$sandbox" sync /Developer
 step "$ctl" --root "$sandbox" unmount /Developer
+step "$ctl" --root "$sandbox" unmount /private/var/personalized_debug
 step "$ctl" --root "$sandbox" unmount /private/var/mnt/nothing-here
 sleep 0.2
 kill "$watch_pid" 2>/dev/null; wait "$watch_pid" 2>/dev/null || true

@@ -14,6 +14,7 @@
 #include "daemon/stale_mount_points.h"
 #include "platform/linux/alert_linux.h"
 #include "platform/linux/ipc_linux.h"
+#include "platform/linux/jobs_spool.h"
 #include "platform/linux/notify_center.h"
 #include "platform/linux/os_sandbox.h"
 #include "platform/linux/registry_disk_images.h"
@@ -136,8 +137,9 @@ int main(int argc, char** argv) {
   std::unique_ptr<ipc::IpcService> ipc = CreateLinuxIpcService(loop, IpcOptions{});
   std::unique_ptr<notify::SystemNotify> notifier = notify::CreateLinuxSystemNotify();
   std::unique_ptr<alert::UserAlertService> alerts = alert::CreateLinuxUserAlertService(loop);
+  jobs::SpoolJobLauncher jobLauncher;
   ScopedServices services(
-      Services{&registry, &os::SystemOs(), ipc.get(), notifier.get(), alerts.get()});
+      Services{&registry, &os::SystemOs(), ipc.get(), notifier.get(), alerts.get(), &jobLauncher});
 
   // Without the port no media or camera notification could ever arrive: a daemon that
   // cannot create it would serve requests but silently ignore hardware, so it stops.

@@ -12,6 +12,7 @@
 
 #include "base/plist.h"
 #include "alert_agent.h"
+#include "jobs_command.h"
 #include "json.h"
 #include "mount_image.h"
 #include "mount_storage.h"
@@ -45,6 +46,7 @@ void PrintUsage(FILE* out) {
       "usage: brisvalectl [--root DIR] [--json] COMMAND [ARGS]\n"
       "commands:\n"
       "  list              list attached and mounted devices (CopyDevices)\n"
+      "  jobs              list the jobs loaded into the service launcher's spool\n"
       "  raw FILE          send the request property list in FILE (XML or binary) and\n"
       "                    print the reply\n"
       "  post-event NAME   post NAME on the hardware event stream (root only)\n"
@@ -302,6 +304,7 @@ int main(int argc, char** argv) {
   }
   const std::string& command = args[0];
   if (command == "list" && args.size() == 1) return List(options);
+  if (command == "jobs" && args.size() == 1) return tools::ListJobs(options.root, options.json);
   if (command == "raw" && args.size() == 2) return Raw(options, args[1]);
   if (command == "post-event" && args.size() == 2) return PostEvent(options, args[1]);
   if (command == "unmount" && args.size() == 2) return MountPathRequest(options, "Unmount", args[1]);

@@ -53,6 +53,9 @@ class LinuxOs final : public Os {
   int OpenFile(const char* path) override;
   int FileSize(int fd, uint64_t& size) override;
   int MapFile(int fd, size_t length, std::unique_ptr<FileMapping>& mapping) override;
+  // os_files_below.cc
+  int ReadFilesBelow(const char* directory, size_t maxFileBytes,
+                     const std::function<bool(const FoundFile&)>& visit) override;
 
  private:
   UniqueFd mountInfo_;               // /proc/self/mountinfo, opened on first use

@@ -1,0 +1,114 @@
+#include "jobs/image_jobs.h"
+
+#include <gtest/gtest.h>
+
+#include "base/log.h"
+#include "fake_os.h"
+#include "job_files.h"
+#include "platform/job_launcher.h"
+#include "platform/linux/os_system.h"
+#include "platform/services.h"
+#include "plist_printers.h"
+
+namespace brisvale {
+namespace {
+
+using plist::Array;
+using plist::Dictionary;
+using plist::Value;
+using testing::Job;
+
+// The real file system, seen from a temporary directory standing in for "/".
+struct RootedOs : testing::FakeOs {
+  std::string root;
+  int ReadFilesBelow(const char* directory, size_t maxFileBytes,
+                     const std::function<bool(const os::FoundFile&)>& visit) override {
+    return os::SystemOs().ReadFilesBelow((root + directory).c_str(), maxFileBytes, visit);
+  }
+};
+
+struct RecordingLauncher : jobs::JobLauncher {
+  std::vector<Dictionary> submitted;
+  std::string refused;  // the label answered with a failure
+  std::optional<jobs::LaunchError> Submit(const Dictionary& job) override {
+    if (*job.find("Label") == Value(refused)) return jobs::LaunchError{"already loaded: " + refused};
+    submitted.push_back(job);
+    return std::nullopt;
+  }
+};
+
+struct ImageJobs : ::testing::Test {
+  testing::TempTree tree;
+  RootedOs os;
+  RecordingLauncher launcher;
+  ScopedServices services{Services{.os = &os, .jobLauncher = &launcher}};
+  log::CaptureSink capture;
+  ImageJobs() { os.root = tree.root.string(); }
+
+};
+
+TEST_F(ImageJobs, FactoryJobsAreRewrittenAndRefusalsOnlyLogged) {
+  const char* mount = "/private/var/factory_mount";
+  tree.Write("private/var/factory_mount/Library/OrbitDaemons/agent.plist",
+             Value(Dictionary{{"Label", "agent"}, {"Program", "/Developer/usr/libexec/agent"}}));
+  tree.Write("private/var/factory_mount/System/Library/OrbitDaemons/dup.plist",
+             Value(Job("dup", Value("/Developer/x"))));
+  launcher.refused = "dup";
+
+  EXPECT_EQ(LoadImageJobs(mount, "Factory"), 0);
+  const Dictionary expected = Job("agent", Value(Array{"/var/factory_mount/usr/libexec/agent"}));
+  EXPECT_EQ(launcher.submitted, std::vector<Dictionary>{expected});
+  EXPECT_TRUE(capture.Contains(Level::Debug, "Submitting orbitd job: \n" + Value(expected).description()));
+  EXPECT_TRUE(capture.Contains(Level::Default, "JvJobSubmit failed: already loaded: dup"));
+
+  tree.Write("private/var/factory_mount/e/Library/OrbitDaemons/j",
+             Value(Dictionary{{"Program", "/Developer/x"}, {"ERROR", "from the job"}}));
+  EXPECT_EQ(LoadImageJobs("/private/var/factory_mount/e", "Factory"), -1);
+  EXPECT_TRUE(capture.Contains(Level::Default, "Failed to copy/fix pist: from the job"));
+}
+
+TEST_F(ImageJobs, RewriteDependsOnTheImageTypeAndMountPoint) {
+  struct Case {
+    const char* type;
+    std::string mountPoint;
+    Value submittedProgram;
+  } cases[] = {
+      {"Personalized", "/private/var/personalized_factory", Value(Array{"/var/personalized_factory/x"})},
+      {"Developer", "/private/var/factory_mount", Value("/Developer/x")},
+  };
+  EXPECT_EQ(LoadImageJobs("/Developer", "Developer"), 0);  // no job directories at all
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.mountPoint);
+    tree.Write(c.mountPoint.substr(1) + "/System/Library/OrbitDaemons/j", Value(Job("j", Value("/Developer/x"))));
+    EXPECT_EQ(LoadImageJobs(c.mountPoint, c.type), 0);
+    ASSERT_EQ(launcher.submitted.size(), 1u);
+    EXPECT_EQ(*launcher.submitted[0].find("ProgramArguments"), c.submittedProgram);
+    launcher.submitted.clear();
+  }
+}
+
+TEST_F(ImageJobs, FailureStopsEachScanButNotTheSecondDirectory) {
+  const std::string first = "Developer/Library/OrbitDaemons/";
+  const std::string second = "Developer/System/Library/OrbitDaemons/";
+  for (const char* name : {"1", "2"}) {
+    tree.Write(first + name, Value());
+    tree.Write(second + name, Value(Job(std::string("second") + name, Value("/Developer/x"))));
+  }
+  // Which file the scan meets first is up to the file system: the good job goes there.
+  std::vector<std::string> order;
+  os.ReadFilesBelow(("/" + first).c_str(), 1 << 20, [&](const os::FoundFile& file) {
+    order.emplace_back(file.relativePath);
+    return true;
+  });
+  ASSERT_EQ(order.size(), 2u);
+  tree.Write(first + order[0], Value(Job("good", Value("/Developer/x"))));
+  tree.Write(first + order[1], Value(Job("bad", Value("/usr/bin/x"))));
+
+  EXPECT_EQ(LoadImageJobs("/Developer", "Developer"), -1);
+  ASSERT_EQ(launcher.submitted.size(), 2u);
+  EXPECT_EQ(*launcher.submitted[0].find("Label"), Value("good"));
+  EXPECT_TRUE(launcher.submitted[1].find("Label")->string()->starts_with("second"));
+}
+
+}  // namespace
+}  // namespace brisvale
