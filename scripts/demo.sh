@@ -138,6 +138,7 @@ rm -f "$request"
 step "$ctl" --root "$sandbox" post-event com.vantrel.brisvale_mounter.attached
 step "$ctl" --root "$sandbox" post-event com.vantrel.example.unknown
 sleep 0.2
+source scripts/demo-media.sh
 
 printf '\n\033[1mDaemon log:\033[0m\n'
 cat "$log"

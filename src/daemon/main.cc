@@ -143,7 +143,9 @@ int main(int argc, char** argv) {
 
   // Without the port no media or camera notification could ever arrive: a daemon that
   // cannot create it would serve requests but silently ignore hardware, so it stops.
+  BackgroundQueue backgroundQueue;
   MatchingContext context;
+  context.backgroundQueue = &backgroundQueue;
   auto port = registry.CreateNotificationPort();
   if (!port.ok() || !port.value) {
     Log(Level::Default, "Failed to create registry notification port: 0x%04x",

@@ -6,6 +6,8 @@
 #include "base/plist.h"
 #include "daemon/matching_context.h"
 #include "inventory/inventory.h"
+#include "media/media_detach.h"
+#include "media/subscriptions.h"
 
 namespace brisvale {
 
@@ -13,9 +15,5 @@ void HandleMountRequest(MatchingContext& context, const plist::Value& request,
                         plist::Dictionary& reply);
 void HandleUnmount(const plist::Value& request, plist::Dictionary& reply);
 void HandleSync(const plist::Value& request, plist::Dictionary& reply);
-
-void SubscribeMediaAttach(MatchingContext& context);
-void SubscribeCameraAttach(MatchingContext& context);
-void HandleMediaDetached();
 
 }  // namespace brisvale

@@ -6,6 +6,7 @@
 #include "base/log.h"
 #include "inventory/inventory.h"
 #include "inventory/paths.h"
+#include "media/cameras.h"
 #include "media/fs_identify.h"
 #include "platform/services.h"
 

@@ -54,8 +54,6 @@ void HandleCopyDevices(const plist::Value& request, plist::Dictionary& reply);
 std::optional<DeviceMap> CopyAttachedDevices();
 // Removable media in the registry, mounted or not, keyed by device path.
 std::optional<DeviceMap> CopyAttachedMediaEntries();
-// At most one camera, under "PTPNode".
-std::optional<DeviceMap> CopyCameraEntries();
 // Entries of `deviceType` whose `key` holds `value`.
 std::optional<plist::Array> CopyEntriesMatching(std::string_view deviceType, std::string_view key,
                                                 const plist::Value& value);
