@@ -61,6 +61,10 @@ struct TreeNode {
   // A directory below the start on which another file system is mounted: the walk
   // reports it before and after, never its contents.
   bool mountPoint = false;
+  // The node's name in the directory that holds it, and that directory's handle, valid
+  // only during the visit: the calls ending in At act on exactly this node.
+  std::string name;
+  int directory = -1;
 };
 
 // How a tree walk ended: 0 when it ran to the end or the visitor stopped it.
@@ -98,18 +102,25 @@ class Os {
   virtual int EjectDevice(int fd) = 0;
 
   // The entries of `path` in directory order, or -errno when it cannot be opened
-  // (`entries` then stays empty).
+  // (`entries` then stays empty) or closed (`entries` filled). A read error ends the
+  // listing like its end.
   virtual int ReadDirectory(const char* path, std::vector<DirectoryEntry>& entries) = 0;
   // The canonical path, or -errno.
   virtual int RealPath(const char* path, std::string& resolved) = 0;
   // Clears the immutable and append-only flags. Links have none; FIFOs and device
   // nodes are left unopened. 0 when there was nothing to clear.
   virtual int ClearFlags(const char* path) = 0;
-  // Walks `root` (followed when it is a link) and everything below it, links not
-  // followed, directories visited before and after their contents, never entering
-  // another file system: a mount point inside the tree is visited but not descended
-  // into. The visitor answers false to stop the walk.
+  // Walks `root` and everything below it, links not followed, directories visited
+  // before and after their contents, never entering another mount: a mount point inside
+  // the tree is visited but not descended into. A root reached through a link, or that
+  // is one, is not walked (openError -ELOOP). The visitor answers false to stop.
   virtual TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) = 0;
+
+  // Unlink, RemoveDirectory and ClearFlags for `name` in the directory handle
+  // `directory` of a TreeNode being visited.
+  virtual int UnlinkAt(int directory, const char* name) = 0;
+  virtual int RemoveDirectoryAt(int directory, const char* name) = 0;
+  virtual int ClearFlagsAt(int directory, const char* name) = 0;
 };
 
 // The operating system this process runs on.

@@ -28,6 +28,9 @@ class LinuxOs final : public Os {
   int RealPath(const char* path, std::string& resolved) override;
   int ClearFlags(const char* path) override;
   TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) override;
+  int UnlinkAt(int directory, const char* name) override;
+  int RemoveDirectoryAt(int directory, const char* name) override;
+  int ClearFlagsAt(int directory, const char* name) override;
 
  private:
   UniqueFd mountInfo_;               // /proc/self/mountinfo, opened on first use
@@ -37,5 +40,8 @@ class LinuxOs final : public Os {
 
 // GetMountTable over a table in the kernel's mountinfo format at `path`.
 int ReadMountTable(const char* path, std::span<MountRecord> records);
+// The whole table at `path`, fields uncut (for the sandbox, which must name every
+// mount exactly); its size or -errno.
+int ReadWholeMountTable(const char* path, std::vector<MountRecord>& records);
 
 }  // namespace brisvale::os

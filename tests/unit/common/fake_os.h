@@ -44,6 +44,9 @@ class FakeOs : public os::Os {
   os::TreeWalk WalkTree(const char*, const std::function<bool(const os::TreeNode&)>&) override {
     return {-ENOSYS, 0};
   }
+  int UnlinkAt(int, const char*) override { return -ENOSYS; }
+  int RemoveDirectoryAt(int, const char*) override { return -ENOSYS; }
+  int ClearFlagsAt(int, const char*) override { return -ENOSYS; }
 };
 
 }  // namespace brisvale::testing
