@@ -100,6 +100,11 @@ class Os {
   // Asks the device behind `fd` to go: a loop device lets go of its file, a removable
   // disk is ejected.
   virtual int EjectDevice(int fd) = 0;
+  // The number of the block device that holds the file system mounted on `path`, or
+  // -ENODEV when none does (a memory or pseudo file system, whatever its source says).
+  virtual int MountedDevice(const char* path, uint64_t& device) = 0;
+  // The number of the block device open on `fd`, or -ENOTBLK.
+  virtual int DeviceNumber(int fd, uint64_t& device) = 0;
 
   // The entries of `path` in directory order, or -errno when it cannot be opened
   // (`entries` then stays empty) or closed (`entries` filled). A read error ends the

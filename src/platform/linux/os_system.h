@@ -23,6 +23,8 @@ class LinuxOs final : public Os {
   int SyncFilesystem(const char* path) override;
   int OpenDevice(const char* devicePath) override;
   int EjectDevice(int fd) override;
+  int MountedDevice(const char* path, uint64_t& device) override;
+  int DeviceNumber(int fd, uint64_t& device) override;
   // os_tree.cc
   int ReadDirectory(const char* path, std::vector<DirectoryEntry>& entries) override;
   int RealPath(const char* path, std::string& resolved) override;
