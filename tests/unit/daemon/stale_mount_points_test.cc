@@ -127,6 +127,13 @@ TEST_F(StaleMountPointsTest, MissingRootIsSilentOtherFailuresAreLogged) {
   EXPECT_EQ(RemoveTree((root / "keep-start").c_str(), 0), 0);
   EXPECT_TRUE(fs::exists(root / "keep-start"));
   EXPECT_FALSE(fs::exists(root / "keep-start/child"));
+
+  // A name that is no text cannot be looked up, so it counts as not mounted.
+  fs::create_directories(root / "stale-\xff/inner");
+  capture.Clear();
+  RemoveStaleMountPoints(root.c_str());
+  EXPECT_THAT(capture.Texts(), ::testing::Contains("Failed to create string."));
+  EXPECT_FALSE(fs::exists(root / "stale-\xff"));
 }
 
 // Each top entry is its own attack; the walk must survive all of them and touch nothing
