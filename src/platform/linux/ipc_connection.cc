@@ -29,9 +29,18 @@ void TransportContext::Shutdown() {
 }
 
 LinuxConnection::LinuxConnection(std::shared_ptr<TransportContext> context, UniqueFd socket)
-    : context_(std::move(context)), socket_(std::move(socket)), peer_(PeerIdentity::FromSocket(socket_.get())) {}
+    : context_(std::move(context)), socket_(std::move(socket)), peer_(PeerIdentity::FromSocket(socket_.get())) {
+  if (peer_.uid() != 0) {
+    ++context_->connectionsByUser[peer_.uid()];
+    ++context_->unprivilegedConnections;
+  }
+}
 
-LinuxConnection::~LinuxConnection() = default;
+LinuxConnection::~LinuxConnection() {
+  if (peer_.uid() == 0) return;
+  if (--context_->connectionsByUser[peer_.uid()] == 0) context_->connectionsByUser.erase(peer_.uid());
+  --context_->unprivilegedConnections;
+}
 
 void LinuxConnection::Resume(Handler handler) {
   if (state_ == State::Resumed) return;

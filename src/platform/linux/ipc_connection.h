@@ -8,6 +8,7 @@
 #include <cstdint>
 #include <deque>
 #include <memory>
+#include <map>
 #include <set>
 #include <string>
 
@@ -37,6 +38,9 @@ struct TransportContext {
   const size_t outgoingQueueLimit;
   std::set<std::shared_ptr<LinuxConnection>> live;
   bool shutDown = false;
+  // Open connections of users other than root, counted from accept to close.
+  std::map<uid_t, size_t> connectionsByUser;
+  size_t unprivilegedConnections = 0;
 };
 
 class LinuxConnection : public Connection, public std::enable_shared_from_this<LinuxConnection> {

@@ -1,5 +1,8 @@
 // The daemon in a sandbox root, driven over its real socket.
+#include <sys/resource.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
 #include <sys/un.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -9,6 +12,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <functional>
 
 #include "platform/linux/ipc_client.h"
 #include "sandbox_daemon.h"
@@ -107,6 +111,94 @@ TEST(DaemonActivation, SocketPassedByTheLauncherIsServed) {
       std::chrono::seconds(10));
   EXPECT_TRUE(reply.ok()) << reply.error;
   unlink(path.c_str());
+}
+
+// What the daemon holds: open descriptors and anonymous memory (KiB).
+std::pair<size_t, long> Holdings(pid_t pid) {
+  const std::string proc = "/proc/" + std::to_string(pid);
+  const auto descriptors = std::distance(std::filesystem::directory_iterator(proc + "/fd"),
+                                         std::filesystem::directory_iterator());
+  long rssAnon = -1;
+  std::ifstream status(proc + "/status");
+  for (std::string line; std::getline(status, line);) {
+    if (line.starts_with("RssAnon:")) rssAnon = std::stol(line.substr(8));
+  }
+  return {static_cast<size_t>(descriptors), rssAnon};
+}
+
+// In a child running as `uid`: opens `count` idle connections to `path` and, once they
+// are all made, runs `then` and exits with its status.
+pid_t AsUser(uid_t uid, const std::string& path, int count, const std::function<int()>& then) {
+  const pid_t pid = fork();
+  if (pid != 0) return pid;
+  rlimit files{};
+  getrlimit(RLIMIT_NOFILE, &files);
+  files.rlim_cur = files.rlim_max;
+  setrlimit(RLIMIT_NOFILE, &files);
+  if (setgid(uid) != 0 || setuid(uid) != 0) _exit(2);
+  for (int i = 0; i < count; ++i) {
+    const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
+    if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) _exit(3);
+  }
+  _exit(then());
+}
+
+int ExitStatus(pid_t pid) {
+  int status = 0;
+  waitpid(pid, &status, 0);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+// 1,000 idle connections of one unprivileged user under a limit of 1,024 descriptors:
+// the surplus is refused with a line, root is served meanwhile, and once they are gone
+// the user is served again.
+TEST_F(DaemonTest, IdleCrowdCannotStopTheService) {
+  constexpr uid_t kNobody = 65534;
+  ASSERT_EQ(chmod(daemon.root().c_str(), 0755), 0);
+  const rlimit limit{1024, 1024};
+  ASSERT_EQ(prlimit(daemon.pid(), RLIMIT_NOFILE, &limit, nullptr), 0);
+  const auto before = Holdings(daemon.pid());
+  int release[2], ready[2];
+  ASSERT_EQ(pipe(release), 0);
+  ASSERT_EQ(pipe(ready), 0);
+  const pid_t crowd = AsUser(kNobody, daemon.ServiceSocket(), 1000, [&] {
+    char byte = 0;
+    close(release[1]);
+    if (write(ready[1], &byte, 1) != 1) return 4;
+    return read(release[0], &byte, 1) == 0 ? 0 : 4;  // until the test lets go
+  });
+  close(release[0]);
+  close(ready[1]);
+  char byte;
+  ASSERT_EQ(read(ready[0], &byte, 1), 1);
+  close(ready[0]);
+  // Root's connection queues behind the crowd's and is served once they are taken in.
+  std::optional<plist::Value> reply;
+  EXPECT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}, &reply).ok());
+  const auto during = Holdings(daemon.pid());
+  EXPECT_TRUE(daemon.LogContains(
+      "default: Refusing a vexa connection of uid 65534: 64 open of 64 for one user, 64 of 256 in all"));
+  close(release[1]);
+  EXPECT_EQ(ExitStatus(crowd), 0);
+  // One more than before: the mount table the first listing opened stays open.
+  for (int i = 0; i < 500 && Holdings(daemon.pid()).first > before.first + 1; ++i) usleep(10000);
+
+  const std::string path = daemon.ServiceSocket();
+  const pid_t single = AsUser(kNobody, path, 0, [&] {
+    auto client = ipc::Client::Connect(path);
+    const plist::Bytes request = plist::WriteBinary(plist::Dictionary{{"RequestType", "CopyDevices"}});
+    return client && client->Request({{"EncodedDictionary", plist::Value(request)}}, std::chrono::seconds(10)).ok()
+               ? 0 : 5;
+  });
+  EXPECT_EQ(ExitStatus(single), 0);
+  const auto after = Holdings(daemon.pid());
+  EXPECT_LE(during.first, 1024u);
+  EXPECT_LE(after.first, before.first + 2);
+  std::printf("descriptors %zu/%zu/%zu, RssAnon KiB %ld/%ld/%ld (before/during/after)\n", before.first,
+              during.first, after.first, before.second, during.second, after.second);
 }
 
 }  // namespace
