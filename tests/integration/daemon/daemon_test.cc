@@ -14,6 +14,7 @@
 #include <fstream>
 #include <functional>
 
+#include "base/unique_fd.h"
 #include "platform/linux/ipc_client.h"
 #include "sandbox_daemon.h"
 
@@ -197,6 +198,42 @@ TEST_F(DaemonTest, IdleCrowdCannotStopTheService) {
   const auto after = Holdings(daemon.pid());
   EXPECT_LE(during.first, 1024u);
   EXPECT_LE(after.first, before.first + 2);
+  std::printf("descriptors %zu/%zu/%zu, RssAnon KiB %ld/%ld/%ld (before/during/after)\n", before.first,
+              during.first, after.first, before.second, during.second, after.second);
+}
+
+// 64 connections that each send half of a 4 MB frame and stop: past the budget of all
+// connections they are cancelled, the daemon stays small, and gives the memory back.
+TEST_F(DaemonTest, ParkedHalfFramesStayWithinTheBudget) {
+  const auto before = Holdings(daemon.pid());
+  std::vector<UniqueFd> parked;
+  const std::vector<uint8_t> half(2'000'000, 'x');
+  for (int i = 0; i < 64; ++i) {
+    UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::snprintf(address.sun_path, sizeof address.sun_path, "%s", daemon.ServiceSocket().c_str());
+    ASSERT_EQ(connect(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    const uint8_t header[4] = {0x00, 0x3D, 0x09, 0x00};  // 4,000,000 bytes follow
+    bool open = send(fd.get(), header, sizeof header, MSG_NOSIGNAL) == 4;
+    for (size_t sent = 0; open && sent < half.size();) {
+      const ssize_t n = send(fd.get(), half.data() + sent, half.size() - sent, MSG_NOSIGNAL);
+      open = n > 0;
+      sent += n > 0 ? static_cast<size_t>(n) : 0;
+    }
+    parked.push_back(std::move(fd));
+  }
+  EXPECT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}).ok());
+  const auto during = Holdings(daemon.pid());
+  parked.clear();
+  EXPECT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}).ok());
+  usleep(200000);
+  const auto after = Holdings(daemon.pid());
+  EXPECT_LT(during.second, before.second + 40 * 1024);  // the 32 MiB budget and what is being read
+  EXPECT_LE(after.second, before.second + 1024);
+  bool cancelled = false;
+  for (const std::string& line : daemon.LogLines()) cancelled |= line.find("over the budget") != std::string::npos;
+  EXPECT_TRUE(cancelled);
   std::printf("descriptors %zu/%zu/%zu, RssAnon KiB %ld/%ld/%ld (before/during/after)\n", before.first,
               during.first, after.first, before.second, during.second, after.second);
 }
