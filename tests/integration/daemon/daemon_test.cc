@@ -10,12 +10,15 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <csignal>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <functional>
 
 #include "base/unique_fd.h"
 #include "platform/linux/ipc_client.h"
+#include "platform/linux/ipc_frame.h"
 #include "sandbox_daemon.h"
 
 namespace brisvale::testing {
@@ -80,6 +83,74 @@ TEST_F(DaemonTest, CallerWhoseExecutableCarriesTheEntitlementIsServedQuietly) {
                            std::filesystem::path(client).filename().string() + "<";
   EXPECT_THAT(daemon.LogLines(), Contains(::testing::StartsWith(processing)));
   EXPECT_THAT(daemon.LogLines(), Not(Contains(::testing::HasSubstr("entitlement"))));
+}
+
+// A process that connects without the entitlement and then execs a program that has it
+// is served without: the daemon goes by the program that connected.
+TEST_F(DaemonTest, ExecAfterConnectIsServedWithoutEntitlements) {
+  const std::string client = daemon.root() + ".entitled-ctl";
+  std::filesystem::copy_file(BRISVALE_CTL_PATH, client, std::filesystem::copy_options::overwrite_existing);
+  const std::string entitlements = plist::WriteXml(
+      plist::Dictionary{{"com.vantrel.private.brisvale.allowedSPI", plist::Array{"SyncDevice"}}});
+  if (setxattr(client.c_str(), "trusted.vexa.entitlements", entitlements.data(), entitlements.size(), 0) != 0) {
+    std::filesystem::remove(client);
+    GTEST_SKIP() << "trusted extended attributes unsupported here";
+  }
+  int pass[2];
+  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pass), 0);
+  const pid_t child = fork();
+  if (child == 0) {
+    const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::snprintf(address.sun_path, sizeof address.sun_path, "%s", daemon.ServiceSocket().c_str());
+    if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) _exit(2);
+    // Hands the connection to the test, then becomes the entitled program.
+    char control[CMSG_SPACE(sizeof(int))] = {};
+    char byte = 0;
+    iovec data{&byte, 1};
+    msghdr message{};
+    message.msg_iov = &data;
+    message.msg_iovlen = 1;
+    message.msg_control = control;
+    message.msg_controllen = sizeof control;
+    CMSG_FIRSTHDR(&message)->cmsg_level = SOL_SOCKET;
+    CMSG_FIRSTHDR(&message)->cmsg_type = SCM_RIGHTS;
+    CMSG_FIRSTHDR(&message)->cmsg_len = CMSG_LEN(sizeof(int));
+    std::memcpy(CMSG_DATA(CMSG_FIRSTHDR(&message)), &fd, sizeof fd);
+    if (sendmsg(pass[1], &message, 0) != 1) _exit(3);
+    execl(client.c_str(), client.c_str(), "--root", daemon.root().c_str(), "watch", static_cast<char*>(nullptr));
+    _exit(4);
+  }
+  char control[CMSG_SPACE(sizeof(int))] = {};
+  char byte = 0;
+  iovec data{&byte, 1};
+  msghdr message{};
+  message.msg_iov = &data;
+  message.msg_iovlen = 1;
+  message.msg_control = control;
+  message.msg_controllen = sizeof control;
+  ASSERT_EQ(recvmsg(pass[0], &message, 0), 1);
+  UniqueFd connection;
+  int received = -1;
+  std::memcpy(&received, CMSG_DATA(CMSG_FIRSTHDR(&message)), sizeof received);
+  connection.Reset(received);
+  const std::string exe = "/proc/" + std::to_string(child) + "/exe";
+  for (int i = 0; i < 200 && std::filesystem::read_symlink(exe).string() != client; ++i) usleep(10000);
+
+  const auto frame = ipc::EncodeFrame(plist::Dictionary{
+      {"EncodedDictionary", plist::Value(plist::WriteBinary(plist::Dictionary{{"RequestType", "Sync"}}))}});
+  ASSERT_TRUE(frame);
+  EXPECT_EQ(send(connection.get(), frame->data(), frame->size(), MSG_NOSIGNAL), static_cast<ssize_t>(frame->size()));
+  EXPECT_TRUE(daemon.WaitForLogLine("default: Serving pid " + std::to_string(child) +
+                                    " without entitlements: it no longer runs the program that connected"));
+  EXPECT_TRUE(daemon.WaitForLogLine(
+      "default: Missing required entitlement (will be required in <kelpie://problem/25909614>): SyncDevice"));
+  kill(child, SIGKILL);
+  waitpid(child, nullptr, 0);
+  close(pass[0]);
+  close(pass[1]);
+  std::filesystem::remove(client);
 }
 
 TEST_F(DaemonTest, HardwareEventsAreLoggedByName) {
