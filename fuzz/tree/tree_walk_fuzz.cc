@@ -130,9 +130,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   // Two bytes per node: its parent among the directories so far and its kind and name.
   for (size_t i = 1; i + 1 < size; i += 2) {
     const int parent = directories[data[i] % directories.size()];
-    const uint8_t spec = data[i + 1];
-    const std::string name(1, static_cast<char>('a' + spec % 8));
-    const int kind = (spec >> 3) % 4;
+    const uint8_t shape = data[i + 1];
+    const std::string name(1, static_cast<char>('a' + shape % 8));
+    const int kind = (shape >> 3) % 4;
     const int id = tree.Add(parent, kind == 1 ? Node::File : kind == 2 ? Node::Link : Node::Directory, name, kind == 3);
     if (id >= 0 && tree.nodes[id].kind == Node::Directory) directories.push_back(id);
   }
