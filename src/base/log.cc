@@ -86,17 +86,25 @@ std::optional<int64_t> AsInteger(const Arg* arg) {
   return std::nullopt;
 }
 
-// The text an argument stands for in %@ and %s; none when it is not text or a value.
+// Text cut to kMaxValueLength like a value's description is.
+std::string Bounded(std::string_view text) {
+  if (text.size() <= kMaxValueLength) return std::string(text);
+  return plist::Value(std::string(text.substr(0, kMaxValueLength + 1))).description(kMaxValueLength);
+}
+
+// The text an argument stands for in %@ and %s, at most kMaxValueLength bytes and the
+// cut mark; none when it is not text or a value.
 std::optional<std::string> AsText(const Arg* arg, bool forObject) {
   if (!arg) return std::nullopt;
-  if (auto* v = std::get_if<const char*>(&arg->value)) return *v ? std::string(*v) : "(null)";
-  if (auto* v = std::get_if<std::string_view>(&arg->value)) return std::string(*v);
+  if (auto* v = std::get_if<const char*>(&arg->value)) return *v ? Bounded(*v) : "(null)";
+  if (auto* v = std::get_if<std::string_view>(&arg->value)) return Bounded(*v);
   if (auto* v = std::get_if<const plist::Value*>(&arg->value)) {
     if (!*v) return plist::Describe(nullptr);
     if (!forObject) {
-      if (const std::string* s = (*v)->string()) return *s;
+      if (const std::string* s = (*v)->string()) return Bounded(*s);
     }
-    return (*v)->description();
+    // Stops early: a request can share one large value among a thousand references.
+    return (*v)->description(kMaxValueLength);
   }
   return std::nullopt;
 }
@@ -397,6 +405,11 @@ std::string Format(std::string_view format, const std::vector<Arg>& args) {
       continue;
     }
     AppendConversion(out, c, reader);
+    if (out.size() > kMaxLineLength) break;
+  }
+  if (out.size() > kMaxLineLength) {
+    // Several long values in one line: the line as a whole is cut the same way.
+    return plist::Value(std::move(out)).description(kMaxLineLength);
   }
   return out;
 }

@@ -97,6 +97,11 @@ struct Arg {
   Arg(std::nullptr_t) : value(static_cast<const plist::Value*>(nullptr)) {}
 };
 
+// A %@ or %s argument prints at most kMaxValueLength bytes and a line at most
+// kMaxLineLength; what goes beyond is cut and marked with plist::kDescriptionCut.
+inline constexpr size_t kMaxValueLength = 4096;
+inline constexpr size_t kMaxLineLength = 16384;
+
 std::string Format(std::string_view format, const std::vector<Arg>& args);
 void Write(Level level, std::string_view text);
 

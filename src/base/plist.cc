@@ -167,65 +167,94 @@ bool Value::operator==(const Value& other) const {
 
 namespace {
 
-void AppendDescription(const Value& value, std::string& out);
-
-void AppendHex(const Bytes& bytes, std::string& out) {
-  static constexpr char kDigits[] = "0123456789abcdef";
-  out += '<';
-  for (uint8_t b : bytes) {
-    out += kDigits[b >> 4];
-    out += kDigits[b & 0xF];
+// Description text with a budget: appends stop once `limit` bytes are exceeded.
+class DescriptionText {
+ public:
+  explicit DescriptionText(size_t limit) : limit_(limit) { out_.reserve(std::min<size_t>(limit, 256) + 1); }
+  bool full() const { return out_.size() > limit_; }
+  void Append(std::string_view text) {
+    if (!full()) out_.append(text.substr(0, limit_ + 1 - out_.size()));
   }
-  out += '>';
+  void Append(char c) {
+    if (!full()) out_ += c;
+  }
+  std::string Take() {
+    if (!full()) return std::move(out_);
+    size_t cut = limit_;
+    // Back to the start of a character, so the text stays valid UTF-8.
+    for (int back = 0; back < 3 && cut > 0 && (static_cast<uint8_t>(out_[cut]) & 0xC0) == 0x80; ++back) --cut;
+    out_.resize(cut);
+    out_ += kDescriptionCut;
+    return std::move(out_);
+  }
+
+ private:
+  size_t limit_;
+  std::string out_;
+};
+
+void AppendDescription(const Value& value, DescriptionText& out);
+
+void AppendHex(const Bytes& bytes, DescriptionText& out) {
+  static constexpr char kDigits[] = "0123456789abcdef";
+  out.Append('<');
+  for (uint8_t b : bytes) {
+    if (out.full()) return;
+    const char digits[2] = {kDigits[b >> 4], kDigits[b & 0xF]};
+    out.Append(std::string_view(digits, 2));
+  }
+  out.Append('>');
 }
 
-void AppendDescription(const Value& value, std::string& out) {
+void AppendDescription(const Value& value, DescriptionText& out) {
   switch (value.kind()) {
     case Kind::String:
-      out += *value.string();
+      out.Append(*value.string());
       return;
     case Kind::Data:
       AppendHex(*value.data(), out);
       return;
     case Kind::Integer: {
       Integer i = *value.integer();
-      out += i.isUnsigned ? std::to_string(i.asUnsigned()) : std::to_string(i.value);
+      out.Append(i.isUnsigned ? std::to_string(i.asUnsigned()) : std::to_string(i.value));
       return;
     }
     case Kind::Real: {
       char buffer[64];
       std::snprintf(buffer, sizeof buffer, "%g", *value.real());
-      out += buffer;
+      out.Append(buffer);
       return;
     }
     case Kind::Boolean:
-      out += *value.boolean() ? "true" : "false";
+      out.Append(*value.boolean() ? "true" : "false");
       return;
     case Kind::Date:
-      out += internal::FormatIsoDate(*value.date());
+      out.Append(internal::FormatIsoDate(*value.date()));
       return;
     case Kind::Array: {
-      out += '[';
-      const char* separator = "";
+      out.Append('[');
+      std::string_view separator;
       for (const Value& element : *value.array()) {
-        out += separator;
+        if (out.full()) return;
+        out.Append(separator);
         AppendDescription(element, out);
         separator = ", ";
       }
-      out += ']';
+      out.Append(']');
       return;
     }
     case Kind::Dictionary: {
-      out += '{';
-      const char* separator = "";
+      out.Append('{');
+      std::string_view separator;
       for (const auto& [key, element] : *value.dictionary()) {
-        out += separator;
-        out += key;
-        out += ": ";
+        if (out.full()) return;
+        out.Append(separator);
+        out.Append(key);
+        out.Append(": ");
         AppendDescription(element, out);
         separator = ", ";
       }
-      out += '}';
+      out.Append('}');
       return;
     }
   }
@@ -233,10 +262,12 @@ void AppendDescription(const Value& value, std::string& out) {
 
 }  // namespace
 
-std::string Value::description() const {
-  std::string out;
+std::string Value::description() const { return description(std::string::npos - 1); }
+
+std::string Value::description(size_t limit) const {
+  DescriptionText out(limit);
   AppendDescription(*this, out);
-  return out;
+  return out.Take();
 }
 
 std::string Describe(const Value* value) { return value ? value->description() : "(null)"; }

@@ -104,6 +104,10 @@ class Value {
   // The text that "%@" prints: a string as itself, numbers in decimal, booleans
   // true/false, data as <0a1bff>, containers in a compact plist-like text.
   std::string description() const;
+  // The same, stopped once it is longer than `limit` bytes: the text is then cut to at
+  // most `limit` bytes (on a character boundary) and ends in kDescriptionCut. The walk
+  // stops there too, so a huge value, or one shared a thousand times, costs no more.
+  std::string description(size_t limit) const;
 
   bool operator==(const Value& other) const;
 
@@ -131,6 +135,8 @@ inline std::vector<Dictionary::Entry>::const_iterator Dictionary::begin() const 
 inline std::vector<Dictionary::Entry>::const_iterator Dictionary::end() const {
   return entries_.end();
 }
+
+inline constexpr std::string_view kDescriptionCut = "...<cut>";
 
 // "%@" of a missing value.
 std::string Describe(const Value* value);

@@ -1,5 +1,7 @@
 // brisvale-mounterd: the composition root. Builds the Linux implementations of the
 // platform interfaces, optionally enters a sandbox root, and runs the daemon.
+#include <sys/resource.h>
+
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
@@ -86,6 +88,12 @@ int main(int argc, char** argv) {
   }
   if (options->verbose || std::getenv("BRISVALE_DEBUG")) log::SetDebugEnabled(true);
   std::signal(SIGPIPE, SIG_IGN);
+  // Every client connection holds descriptors: take all the hard limit allows, so the
+  // soft default of 1024 does not decide how many clients can wait at once.
+  if (rlimit files{}; getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
+    files.rlim_cur = files.rlim_max;
+    setrlimit(RLIMIT_NOFILE, &files);
+  }
 
   std::string error;
   if (options->root && options->teardown) {

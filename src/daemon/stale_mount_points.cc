@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "base/log.h"
+#include "base/utf8.h"
 #include "inventory/inventory.h"
 #include "platform/os.h"
 #include "platform/services.h"
@@ -48,11 +49,14 @@ int RemoveTree(const char* path, int removeStart) {
   os::Os& os = *CurrentServices().os;
   const std::string start = std::string(path).substr(0, kPathBufferSize);
   int result = 0;
+  // Every removal names the node relative to the directory the walk holds open, so a
+  // directory swapped for a link meanwhile loses the link, never what it points to.
   const os::TreeWalk walk = os.WalkTree(start.c_str(), [&](const os::TreeNode& node) {
     using Kind = os::TreeNode::Kind;
+    const char* name = node.name.c_str();
     if (node.kind == Kind::NonDirectory) {
-      os.ClearFlags(node.path.c_str());
-      if (const int rc = os.Unlink(node.path.c_str()); rc < 0) {
+      os.ClearFlagsAt(node.directory, name);
+      if (const int rc = os.UnlinkAt(node.directory, name); rc < 0) {
         Log(Level::Default, "Failed to unlink %s: %{errno}d", node.path.c_str(), -rc);
         result = -1;
         return false;
@@ -60,13 +64,13 @@ int RemoveTree(const char* path, int removeStart) {
     } else if (node.kind == Kind::DirectoryPreorder && !node.mountPoint) {
       // An immutable or append-only directory refuses to let its entries go, so its
       // flags go before its contents are visited.
-      os.ClearFlags(node.path.c_str());
+      os.ClearFlagsAt(node.directory, name);
     } else if (node.kind == Kind::DirectoryPostorder && (node.level > 0 || removeStart)) {
       // A mount point inside the tree was not descended into and its flags belong to
       // the other file system: it is left untouched, and removing its still covered
       // directory fails and is logged.
-      if (!node.mountPoint) os.ClearFlags(node.path.c_str());
-      if (const int rc = os.RemoveDirectory(node.path.c_str()); rc < 0) {
+      if (!node.mountPoint) os.ClearFlagsAt(node.directory, name);
+      if (const int rc = os.RemoveDirectoryAt(node.directory, name); rc < 0) {
         Log(Level::Default, "Failed to remove %s: %{errno}d", node.path.c_str(), -rc);
         result = -1;
         return false;
@@ -94,6 +98,8 @@ void RemoveStaleMountPoints(const char* mountRoot) {
     return;
   }
   const std::vector<std::string> mountedPaths = entries.empty() ? std::vector<std::string>() : MountedPaths(os);
+  std::string resolvedRoot;
+  if (!entries.empty() && os.RealPath(mountRoot, resolvedRoot) < 0) resolvedRoot = mountRoot;
   for (const os::DirectoryEntry& entry : entries) {
     const std::string joined = (std::string(mountRoot) + "/" + entry.name).substr(0, kPathBufferSize - 1);
     // A link is removed itself, never resolved: resolving it would aim the removal at
@@ -101,7 +107,15 @@ void RemoveStaleMountPoints(const char* mountRoot) {
     // because the mount table lists resolved paths ("/var/mnt" is "/private/var/mnt").
     std::string resolved;
     if (entry.isLink || os.RealPath(joined.c_str(), resolved) < 0) resolved = joined;
-    if (!entry.isLink && IsMounted(resolved, mountedPaths)) {
+    // An entry swapped for a link since the root was read resolves somewhere else:
+    // that place is not the root's to empty.
+    if (!entry.isLink && resolved != joined && resolved != resolvedRoot + "/" + entry.name) {
+      Log(Level::Default, "Skipping %s: it resolves to %s.", joined.c_str(), resolved.c_str());
+      continue;
+    }
+    if (!utf8::IsValid(resolved)) {
+      Log(Level::Default, "Failed to create string.");  // the inventory holds text only
+    } else if (!entry.isLink && IsMounted(resolved, mountedPaths)) {
       Log(Level::Debug, "Skipping destruction of mounted filesystem %s.", resolved.c_str());
       continue;
     }

@@ -1,6 +1,9 @@
 #include "daemon/unmount.h"
 
+#include <cerrno>
+#include <cstdint>
 #include <cstring>
+#include <optional>
 #include <string>
 
 #include "base/log.h"
@@ -19,6 +22,27 @@ using log::Log;
 constexpr const char* kUnmountedNotification = "com.vantrel.brisvale_unmounted";
 // Mount points under this prefix are fixed directories of the system image.
 constexpr std::string_view kKeptMountPointPrefix = "/Developer";
+
+// Ejects `deviceNode` only when it is the block device numbered `heldBy`; the mount
+// table's source is text anyone mounting can choose, so it names no device by itself.
+void EjectDeviceHolding(const char* deviceNode, std::optional<uint64_t> heldBy) {
+  os::Os& os = *CurrentServices().os;
+  if (!heldBy) {
+    Log(Level::Default, "Failed to eject %s : %{errno}d", deviceNode, ENODEV);
+    return;
+  }
+  const int opened = os.OpenDevice(deviceNode);
+  if (opened < 0) {
+    Log(Level::Default, "Failed to open %s : %{errno}d", deviceNode, -opened);
+    return;
+  }
+  const UniqueFd device(opened);
+  uint64_t number = 0;
+  int rc = os.DeviceNumber(device.get(), number);
+  if (rc == 0 && number != *heldBy) rc = -ENODEV;
+  if (rc == 0) rc = os.EjectDevice(device.get());
+  if (rc < 0) Log(Level::Default, "Failed to eject %s : %{errno}d", deviceNode, -rc);
+}
 
 }  // namespace
 
@@ -54,6 +78,9 @@ void HandleUnmount(const plist::Value& request, plist::Dictionary& reply) {
   }
 
   os::Os& os = *CurrentServices().os;
+  // Which device holds the file system can only be asked while it is mounted.
+  std::optional<uint64_t> heldBy;
+  if (uint64_t device = 0; os.MountedDevice(mountPath.c_str(), device) == 0) heldBy = device;
   if (const int rc = os.Unmount(mountPath.c_str(), /*force=*/true); rc < 0) {
     Log(Level::Default, "Failed to force unmount %@: %s", *mountPathValue, std::strerror(-rc));
     return;
@@ -66,7 +93,7 @@ void HandleUnmount(const plist::Value& request, plist::Dictionary& reply) {
       return;
     }
   }
-  EjectDevice(deviceNode->string()->c_str());
+  EjectDeviceHolding(deviceNode->string()->c_str(), heldBy);
   Log(Level::Debug, "Posting a notification that regular storage has been unmounted");
   if (notify::SystemNotify* center = CurrentServices().notify) center->Post(notify::Named(kUnmountedNotification));
   reply.set("Status", plist::Value("Success"));

@@ -64,6 +64,10 @@ struct TreeNode {
   // A directory below the start on which another file system is mounted: the walk
   // reports it before and after, never its contents.
   bool mountPoint = false;
+  // The node's name in the directory that holds it, and that directory's handle, valid
+  // only during the visit: the calls ending in At act on exactly this node.
+  std::string name;
+  int directory = -1;
 };
 
 // A regular file found by ReadFilesBelow, read in full. Valid during the visit only.
@@ -135,19 +139,25 @@ class Os {
   // Asks the device behind `fd` to go: a loop device lets go of its file, a removable
   // disk is ejected.
   virtual int EjectDevice(int fd) = 0;
+  // The number of the block device that holds the file system mounted on `path`, or
+  // -ENODEV when none does (a memory or pseudo file system, whatever its source says).
+  virtual int MountedDevice(const char* path, uint64_t& device) = 0;
+  // The number of the block device open on `fd`, or -ENOTBLK.
+  virtual int DeviceNumber(int fd, uint64_t& device) = 0;
 
   // The entries of `path` in directory order, or -errno when it cannot be opened
-  // (`entries` then stays empty).
+  // (`entries` then stays empty) or closed (`entries` filled). A read error ends the
+  // listing like its end.
   virtual int ReadDirectory(const char* path, std::vector<DirectoryEntry>& entries) = 0;
   // The canonical path, or -errno.
   virtual int RealPath(const char* path, std::string& resolved) = 0;
   // Clears the immutable and append-only flags. Links have none; FIFOs and device
   // nodes are left unopened. 0 when there was nothing to clear.
   virtual int ClearFlags(const char* path) = 0;
-  // Walks `root` (followed when it is a link) and everything below it, links not
-  // followed, directories visited before and after their contents, never entering
-  // another file system: a mount point inside the tree is visited but not descended
-  // into. The visitor answers false to stop the walk.
+  // Walks `root` and everything below it, links not followed, directories visited
+  // before and after their contents, never entering another mount: a mount point inside
+  // the tree is visited but not descended into. A root reached through a link, or that
+  // is one, is not walked (openError -ELOOP). The visitor answers false to stop.
   virtual TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) = 0;
   // Reads every regular file at any depth below `directory`, hidden ones included, in
   // directory order, going into a subdirectory as soon as it is met. Never follows a
@@ -201,6 +211,12 @@ class Os {
   virtual int FileSize(int fd, uint64_t& size) = 0;
   // Maps the first `length` bytes of `fd` read-only and private.
   virtual int MapFile(int fd, size_t length, std::unique_ptr<FileMapping>& mapping) = 0;
+
+  // Unlink, RemoveDirectory and ClearFlags for `name` in the directory handle
+  // `directory` of a TreeNode being visited.
+  virtual int UnlinkAt(int directory, const char* name) = 0;
+  virtual int RemoveDirectoryAt(int directory, const char* name) = 0;
+  virtual int ClearFlagsAt(int directory, const char* name) = 0;
 };
 
 // The operating system this process runs on.

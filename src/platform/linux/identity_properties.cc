@@ -37,7 +37,13 @@ ValueKind IdentityValue::kind() const {
 std::optional<uint64_t> IdentityValue::int64() const {
   if (auto integer = value_.integer()) return integer->asUnsigned();
   if (auto flag = value_.boolean()) return *flag ? 1 : 0;
-  if (auto real = value_.real()) return static_cast<uint64_t>(static_cast<int64_t>(*real));
+  if (auto real = value_.real()) {
+    // Converting a real outside the integer's range (or NaN) is undefined: such a value
+    // answers none. Negative ones keep the two's complement the integer kind has.
+    constexpr double kTwoTo63 = 9223372036854775808.0;
+    if (*real >= -kTwoTo63 && *real < kTwoTo63) return static_cast<uint64_t>(static_cast<int64_t>(*real));
+    if (*real >= kTwoTo63 && *real < 2 * kTwoTo63) return static_cast<uint64_t>(*real);
+  }
   return std::nullopt;
 }
 

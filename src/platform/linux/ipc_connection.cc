@@ -1,5 +1,7 @@
 #include "platform/linux/ipc_connection.h"
 
+#include <malloc.h>
+
 #include <errno.h>
 #include <string.h>
 #include <sys/epoll.h>
@@ -18,6 +20,8 @@ namespace {
 constexpr size_t kReadChunk = 64 * 1024;
 // Chunks read per wake-up, so that one busy peer cannot starve the others.
 constexpr int kReadsPerWakeup = 4;
+// Giving memory back to the system costs a walk of the heap: only after a large buffer.
+constexpr size_t kTrimThreshold = 1 << 20;
 
 }  // namespace
 
@@ -29,9 +33,19 @@ void TransportContext::Shutdown() {
 }
 
 LinuxConnection::LinuxConnection(std::shared_ptr<TransportContext> context, UniqueFd socket)
-    : context_(std::move(context)), socket_(std::move(socket)), peer_(PeerIdentity::FromSocket(socket_.get())) {}
+    : context_(std::move(context)), socket_(std::move(socket)), peer_(PeerIdentity::FromSocket(socket_.get())) {
+  if (peer_.uid() != 0) {
+    ++context_->connectionsByUser[peer_.uid()];
+    ++context_->unprivilegedConnections;
+  }
+}
 
-LinuxConnection::~LinuxConnection() = default;
+LinuxConnection::~LinuxConnection() {
+  ReleaseBuffers();
+  if (peer_.uid() == 0) return;
+  if (--context_->connectionsByUser[peer_.uid()] == 0) context_->connectionsByUser.erase(peer_.uid());
+  --context_->unprivilegedConnections;
+}
 
 void LinuxConnection::Resume(Handler handler) {
   if (state_ == State::Resumed) return;
@@ -68,6 +82,7 @@ bool LinuxConnection::Send(const Message& message) {
   queuedBytes_ += frame->size();
   outgoing_.push_back(std::move(*frame));
   if (outgoing_.size() == 1 && !WriteQueued()) return false;
+  if (!AccountBuffers()) return false;
   UpdateInterest();
   return true;
 }
@@ -147,7 +162,7 @@ void LinuxConnection::ReadAvailable() {
     }
     if (static_cast<size_t>(count) < buffer.size()) break;
   }
-  if (state_ != State::Resumed) return;
+  if (state_ != State::Resumed || !AccountBuffers()) return;
   if (peerClosed) {
     if (reader_.HasPartialFrame()) {
       Log(Level::Debug, "vexa peer %d closed its connection in the middle of a frame", static_cast<int>(PeerPid()));
@@ -177,7 +192,7 @@ bool LinuxConnection::WriteQueued() {
       outgoingOffset_ = 0;
     }
   }
-  return true;
+  return state_ == State::Closed || AccountBuffers();
 }
 
 void LinuxConnection::UpdatePartialFrameTimer() {
@@ -218,8 +233,31 @@ void LinuxConnection::Close(const std::string& reason) {
   WriteQueued();
   outgoing_.clear();
   queuedBytes_ = 0;
+  reader_ = FrameReader();
+  ReleaseBuffers();
   socket_.Reset();
   context_->loop.Post([self = shared_from_this()] { self->DeliverInvalid(); });
+}
+
+bool LinuxConnection::AccountBuffers() {
+  const size_t now = reader_.BufferedBytes() + queuedBytes_;
+  const size_t before = accountedBytes_;
+  context_->bufferedBytes = context_->bufferedBytes - before + now;
+  accountedBytes_ = now;
+  if (now > before && context_->bufferedBytes > context_->bufferBudget) {
+    Close("buffered bytes over the budget of all connections (" + std::to_string(context_->bufferedBytes) +
+          " of " + std::to_string(context_->bufferBudget) + ")");
+    return false;
+  }
+  if (before >= now + kTrimThreshold) malloc_trim(0);
+  return true;
+}
+
+void LinuxConnection::ReleaseBuffers() {
+  context_->bufferedBytes -= accountedBytes_;
+  // Large frames come from the heap's top or its own mappings: give them back.
+  if (accountedBytes_ >= kTrimThreshold) malloc_trim(0);
+  accountedBytes_ = 0;
 }
 
 void LinuxConnection::DeliverInvalid() {

@@ -8,6 +8,7 @@
 #include <cstdint>
 #include <deque>
 #include <memory>
+#include <map>
 #include <set>
 #include <string>
 
@@ -37,6 +38,13 @@ struct TransportContext {
   const size_t outgoingQueueLimit;
   std::set<std::shared_ptr<LinuxConnection>> live;
   bool shutDown = false;
+  // Open connections of users other than root, counted from accept to close.
+  std::map<uid_t, size_t> connectionsByUser;
+  size_t unprivilegedConnections = 0;
+  // Bytes all connections hold in incomplete frames and unsent replies, and the most
+  // they may hold together: a connection that takes more is cancelled.
+  size_t bufferedBytes = 0;
+  size_t bufferBudget = 32u << 20;
 };
 
 class LinuxConnection : public Connection, public std::enable_shared_from_this<LinuxConnection> {
@@ -68,6 +76,10 @@ class LinuxConnection : public Connection, public std::enable_shared_from_this<L
   // Closes the socket and queues the one ConnectionInvalid event. `reason` is logged
   // when the transport itself ended the connection.
   void Close(const std::string& reason = {});
+  // Brings this connection's share of the buffered bytes up to date; cancels it and
+  // answers false when it grew past what all connections may hold together.
+  bool AccountBuffers();
+  void ReleaseBuffers();
   void DeliverInvalid();
 
   std::shared_ptr<TransportContext> context_;
@@ -86,6 +98,7 @@ class LinuxConnection : public Connection, public std::enable_shared_from_this<L
   std::deque<plist::Bytes> outgoing_;
   size_t outgoingOffset_ = 0;  // bytes of outgoing_.front() already written
   size_t queuedBytes_ = 0;
+  size_t accountedBytes_ = 0;  // this connection's part of context_->bufferedBytes
 };
 
 }  // namespace brisvale::ipc

@@ -43,6 +43,8 @@ class FrameReader {
 
   // True while part of a frame has arrived and the rest has not.
   bool HasPartialFrame() const { return !buffer_.empty(); }
+  // The bytes held for the incomplete frame.
+  size_t BufferedBytes() const { return buffer_.capacity(); }
   bool Failed() const { return failure_.has_value(); }
 
  private:

@@ -25,7 +25,10 @@ class LinuxListener : public Listener {
 
  private:
   void AcceptReady();
-  void PauseAccepting();
+  // Out of descriptors: the one held in reserve makes room to take the waiting
+  // connection off the queue and close it, so the listener never stalls.
+  void ShedOneConnection();
+  bool Admit(const LinuxConnection& connection) const;
 
   std::shared_ptr<TransportContext> context_;
   UniqueFd socket_;
@@ -33,7 +36,7 @@ class LinuxListener : public Listener {
   ino_t ownedInode_ = 0;
   Handler handler_;
   SourceHandle source_;
-  SourceHandle resumeTimer_;
+  UniqueFd reserve_;
   std::shared_ptr<bool> alive_ = std::make_shared<bool>(true);
 };
 

@@ -5,6 +5,7 @@
 
 #include <sys/types.h>
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -36,9 +37,19 @@ class PeerIdentity {
   // every look-up by pid, so that the look-up cannot have reached a successor.
   bool StillRunning() const;
 
+  // What the process ran when it connected: its executable file and its start time.
+  struct Image {
+    uint64_t device = 0;
+    uint64_t inode = 0;
+    uint64_t startTime = 0;
+    bool operator==(const Image&) const = default;
+  };
+  static std::optional<Image> ReadImage(pid_t pid);
+
   pid_t pid_ = 0;
   uid_t uid_ = static_cast<uid_t>(-1);
   UniqueFd pidfd_;
+  std::optional<Image> image_;
 };
 
 }  // namespace brisvale::ipc

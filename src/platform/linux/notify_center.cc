@@ -1,5 +1,7 @@
 #include "platform/linux/notify_center.h"
 
+#include <dirent.h>
+#include <fcntl.h>
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -10,6 +12,7 @@
 #include <cerrno>
 #include <cstring>
 #include <filesystem>
+#include <memory>
 #include <vector>
 
 namespace brisvale::notify {
@@ -26,6 +29,10 @@ std::optional<sockaddr_un> Address(const std::string& path) {
   return address;
 }
 
+struct DirCloser {
+  void operator()(DIR* dir) const { ::closedir(dir); }
+};
+
 class LinuxSystemNotify final : public SystemNotify {
  public:
   explicit LinuxSystemNotify(std::string directory) : directory_(std::move(directory)) {
@@ -37,17 +44,23 @@ class LinuxSystemNotify final : public SystemNotify {
   void Post(const Notification& notification) override {
     if (!socket_) return;
     const plist::Bytes bytes = EncodeNotification(notification);
-    std::error_code error;
-    for (const auto& entry : std::filesystem::directory_iterator(directory_, error)) {
-      const std::string path = entry.path().string();
-      if (!entry.path().filename().string().starts_with(kSubscriberPrefix)) continue;
-      const std::optional<sockaddr_un> address = Address(path);
+    // Every socket in the directory is a subscriber, whatever its name. Read with plain
+    // calls: nothing here may throw, as a throwing directory iterator would.
+    const std::unique_ptr<DIR, DirCloser> dir(::opendir(directory_.c_str()));
+    if (!dir) return;
+    const int dirFd = ::dirfd(dir.get());
+    while (const dirent* entry = ::readdir(dir.get())) {
+      if (entry->d_type != DT_SOCK && entry->d_type != DT_UNKNOWN) continue;
+      struct stat status {};
+      if (::fstatat(dirFd, entry->d_name, &status, AT_SYMLINK_NOFOLLOW) != 0 || !S_ISSOCK(status.st_mode)) continue;
+      const std::optional<sockaddr_un> address = Address(directory_ + "/" + entry->d_name);
       if (!address) continue;
       const ssize_t sent = ::sendto(socket_.get(), bytes.data(), bytes.size(), MSG_DONTWAIT | MSG_NOSIGNAL,
                                     reinterpret_cast<const sockaddr*>(&*address), sizeof *address);
       // Nobody is bound there any more: the subscriber died without cleaning up. A full
-      // queue (EAGAIN) only costs that subscriber this one notification.
-      if (sent < 0 && (errno == ECONNREFUSED || errno == ENOTSOCK)) ::unlink(path.c_str());
+      // queue (EAGAIN) only costs that subscriber this one notification, and a stream
+      // socket (EPROTOTYPE) is no subscriber.
+      if (sent < 0 && errno == ECONNREFUSED) ::unlinkat(dirFd, entry->d_name, 0);
     }
   }
 

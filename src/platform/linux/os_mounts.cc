@@ -57,20 +57,37 @@ int ParseMountTable(FILE* stream, std::vector<MountRecord>& records) {
   return static_cast<int>(records.size());
 }
 
+// The daemon sees the table through fixed-size fields: paths of at most 1023 bytes and
+// type names of at most 15, cut like the platform's own table cuts them.
+constexpr size_t kMaxPathLength = 1023;
+constexpr size_t kMaxTypeNameLength = 15;
+
+MountRecord Cut(const MountRecord& record) {
+  MountRecord cut = record;
+  if (cut.typeName.size() > kMaxTypeNameLength) cut.typeName.resize(kMaxTypeNameLength);
+  if (cut.mountedOn.size() > kMaxPathLength) cut.mountedOn.resize(kMaxPathLength);
+  if (cut.mountedFrom.size() > kMaxPathLength) cut.mountedFrom.resize(kMaxPathLength);
+  return cut;
+}
+
 int CountOrFill(const std::vector<MountRecord>& table, std::span<MountRecord> records) {
   if (records.empty()) return static_cast<int>(table.size());
   const size_t filled = std::min(records.size(), table.size());
-  std::copy_n(table.begin(), filled, records.begin());
+  std::transform(table.begin(), table.begin() + static_cast<std::ptrdiff_t>(filled), records.begin(), Cut);
   return static_cast<int>(filled);
 }
 
 }  // namespace
 
-int ReadMountTable(const char* path, std::span<MountRecord> records) {
+int ReadWholeMountTable(const char* path, std::vector<MountRecord>& records) {
   std::unique_ptr<FILE, FileCloser> stream(std::fopen(path, "re"));
   if (!stream) return -errno;
+  return ParseMountTable(stream.get(), records);
+}
+
+int ReadMountTable(const char* path, std::span<MountRecord> records) {
   std::vector<MountRecord> table;
-  if (int rc = ParseMountTable(stream.get(), table); rc < 0) return rc;
+  if (int rc = ReadWholeMountTable(path, table); rc < 0) return rc;
   return CountOrFill(table, records);
 }
 

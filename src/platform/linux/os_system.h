@@ -26,6 +26,8 @@ class LinuxOs final : public Os {
   int SyncFilesystem(const char* path) override;
   int OpenDevice(const char* devicePath) override;
   int EjectDevice(int fd) override;
+  int MountedDevice(const char* path, uint64_t& device) override;
+  int DeviceNumber(int fd, uint64_t& device) override;
   // os_tree.cc
   int ReadDirectory(const char* path, std::vector<DirectoryEntry>& entries) override;
   int RealPath(const char* path, std::string& resolved) override;
@@ -56,6 +58,9 @@ class LinuxOs final : public Os {
   // os_files_below.cc
   int ReadFilesBelow(const char* directory, size_t maxFileBytes,
                      const std::function<bool(const FoundFile&)>& visit) override;
+  int UnlinkAt(int directory, const char* name) override;
+  int RemoveDirectoryAt(int directory, const char* name) override;
+  int ClearFlagsAt(int directory, const char* name) override;
 
  private:
   UniqueFd mountInfo_;               // /proc/self/mountinfo, opened on first use
@@ -70,5 +75,8 @@ bool DiskHasMountedPartition(dev_t device, const std::string& sysRoot = "/sys",
 
 // GetMountTable over a table in the kernel's mountinfo format at `path`.
 int ReadMountTable(const char* path, std::span<MountRecord> records);
+// The whole table at `path`, fields uncut (for the sandbox, which must name every
+// mount exactly); its size or -errno.
+int ReadWholeMountTable(const char* path, std::vector<MountRecord>& records);
 
 }  // namespace brisvale::os

@@ -1,10 +1,14 @@
-// Directory reading and the tree walk of the start-up clean-up, with flag clearing.
+// Directory reading, flag clearing and removal relative to a directory, and the tree
+// walk over the real file system.
 #include <dirent.h>
 #include <fcntl.h>
-#include <fts.h>
 #include <linux/fs.h>
+#include <linux/openat2.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/sysmacros.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <climits>
@@ -13,6 +17,7 @@
 
 #include "base/unique_fd.h"
 #include "platform/linux/os_system.h"
+#include "platform/linux/os_tree_walk.h"
 
 namespace brisvale::os {
 namespace {
@@ -29,21 +34,58 @@ unsigned char TypeAt(int dirFd, const char* name) {
   return S_ISLNK(status.st_mode) ? DT_LNK : DT_REG;
 }
 
-TreeNode::Kind KindOf(const FTSENT& entry) {
-  switch (entry.fts_info) {
-    case FTS_D:
-      return TreeNode::Kind::DirectoryPreorder;
-    case FTS_DP:
-      return TreeNode::Kind::DirectoryPostorder;
-    case FTS_F:
-    case FTS_SL:
-    case FTS_SLNONE:
-    case FTS_DEFAULT:
-      return TreeNode::Kind::NonDirectory;
-    default:  // FTS_DC, FTS_DNR, FTS_ERR, FTS_NS, FTS_NSOK, FTS_DOT
-      return TreeNode::Kind::Other;
+// Directories by descriptor, for the tree walk.
+class LinuxDirectories final : public DirectoryAccess {
+ public:
+  int OpenPath(const char* path) override {
+    open_how how{};
+    how.flags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+    how.resolve = RESOLVE_NO_SYMLINKS;
+    const long fd = ::syscall(SYS_openat2, AT_FDCWD, path, &how, sizeof how);
+    return fd >= 0 ? static_cast<int>(fd) : -errno;
   }
-}
+  int OpenChild(int dir, const char* name) override {
+    const int fd = ::openat(dir, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    return fd >= 0 ? fd : -errno;
+  }
+  int OpenParent(int dir) override { return OpenChild(dir, ".."); }
+  void Close(int handle) override { ::close(handle); }
+  int IdentityOf(int dir, Identity& identity) override {
+    struct statx status {};
+    if (::statx(dir, "", AT_EMPTY_PATH, STATX_INO | STATX_MNT_ID, &status) != 0) return -errno;
+    identity.device = makedev(status.stx_dev_major, status.stx_dev_minor);
+    identity.inode = status.stx_ino;
+    identity.mountId = (status.stx_mask & STATX_MNT_ID) ? status.stx_mnt_id : 0;
+    identity.mountRoot = (status.stx_attributes_mask & STATX_ATTR_MOUNT_ROOT) &&
+                         (status.stx_attributes & STATX_ATTR_MOUNT_ROOT);
+    return 0;
+  }
+  int List(int dir, std::vector<std::string>& names) override {
+    names.clear();
+    // Read straight from the walk's own descriptor, fresh from its open, rather than
+    // through a second one: every extra descriptor is one more close per directory.
+    alignas(dirent64) char buffer[32768];
+    for (;;) {
+      const ssize_t length = ::getdents64(dir, buffer, sizeof buffer);
+      if (length < 0) return -errno;
+      if (length == 0) return 0;
+      for (ssize_t offset = 0; offset < length;) {
+        const auto* entry = reinterpret_cast<const dirent64*>(buffer + offset);
+        const std::string_view name = entry->d_name;
+        if (name != "." && name != "..") names.emplace_back(name);
+        offset += entry->d_reclen;
+      }
+    }
+  }
+  int TypeOf(int dir, const char* name) override {
+    struct stat status {};
+    if (::fstatat(dir, name, &status, AT_SYMLINK_NOFOLLOW) != 0) return -errno;
+    if (S_ISDIR(status.st_mode)) return kDirectory;
+    return S_ISLNK(status.st_mode) ? kLink : kOther;
+  }
+};
+
+int Status(int rc) { return rc == 0 ? 0 : -errno; }
 
 }  // namespace
 
@@ -60,7 +102,8 @@ int LinuxOs::ReadDirectory(const char* path, std::vector<DirectoryEntry>& entrie
     entries.push_back({std::string(name), type == DT_DIR, type == DT_LNK});
     errno = 0;
   }
-  if (errno != 0) return -errno;
+  // A read error ends the listing as its end does: the entries read so far are served,
+  // and the error is no failure to open or to close.
   if (::closedir(dir.release()) != 0) return -errno;
   return 0;
 }
@@ -72,13 +115,18 @@ int LinuxOs::RealPath(const char* path, std::string& resolved) {
   return 0;
 }
 
-int LinuxOs::ClearFlags(const char* path) {
-  struct stat status {};
-  if (::lstat(path, &status) != 0) return -errno;
+int LinuxOs::ClearFlags(const char* path) { return ClearFlagsAt(AT_FDCWD, path); }
+
+int LinuxOs::ClearFlagsAt(int directory, const char* name) {
+  struct statx status {};
+  if (::statx(directory, name, AT_SYMLINK_NOFOLLOW, STATX_TYPE, &status) != 0) return -errno;
   // Only regular files and directories carry the flags and can be opened without side
   // effects: opening a FIFO or a device node could block or wake hardware.
-  if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode)) return 0;
-  const UniqueFd fd(::open(path, O_RDONLY | O_NONBLOCK | O_NOFOLLOW | O_CLOEXEC));
+  if (!S_ISREG(status.stx_mode) && !S_ISDIR(status.stx_mode)) return 0;
+  // Where the file system reports both flags as clear, nothing needs opening.
+  constexpr uint64_t kFlags = STATX_ATTR_IMMUTABLE | STATX_ATTR_APPEND;
+  if ((status.stx_attributes_mask & kFlags) == kFlags && (status.stx_attributes & kFlags) == 0) return 0;
+  const UniqueFd fd(::openat(directory, name, O_RDONLY | O_NONBLOCK | O_NOFOLLOW | O_CLOEXEC));
   if (!fd) return -errno;
   int flags = 0;
   if (::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) != 0) {
@@ -90,31 +138,19 @@ int LinuxOs::ClearFlags(const char* path) {
   return ::ioctl(fd.get(), FS_IOC_SETFLAGS, &kept) == 0 ? 0 : -errno;
 }
 
+int LinuxOs::UnlinkAt(int directory, const char* name) { return Status(::unlinkat(directory, name, 0)); }
+
+int LinuxOs::RemoveDirectoryAt(int directory, const char* name) {
+  return Status(::unlinkat(directory, name, AT_REMOVEDIR));
+}
+
 TreeWalk LinuxOs::WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) {
-  TreeWalk result;
-  char* paths[] = {const_cast<char*>(root), nullptr};
-  // Physical walk (links are nodes, not followed) with the start path followed when it
-  // is a link, and never into another file system: a mount point inside the tree is
-  // reported as a directory without its contents.
-  FTS* walk = ::fts_open(paths, FTS_PHYSICAL | FTS_COMFOLLOW | FTS_XDEV | FTS_NOCHDIR, nullptr);
-  if (!walk) {
-    result.openError = -errno;
-    return result;
-  }
-  dev_t startDevice = 0;
-  while (const FTSENT* entry = ::fts_read(walk)) {
-    TreeNode node{KindOf(*entry), std::string(entry->fts_path, entry->fts_pathlen),
-                  static_cast<int>(entry->fts_level)};
-    const bool directory = entry->fts_info == FTS_D || entry->fts_info == FTS_DP;
-    if (entry->fts_level == FTS_ROOTLEVEL) {
-      if (directory) startDevice = entry->fts_statp->st_dev;
-    } else if (directory) {
-      node.mountPoint = entry->fts_statp->st_dev != startDevice;
-    }
-    if (!visit(node)) break;
-  }
-  if (::fts_close(walk) != 0) result.closeError = -errno;
-  return result;
+  return WalkDirectoryTree(root, visit);
+}
+
+TreeWalk WalkDirectoryTree(const char* root, const std::function<bool(const TreeNode&)>& visit) {
+  LinuxDirectories directories;
+  return WalkTreeWith(directories, root, visit);
 }
 
 }  // namespace brisvale::os

@@ -59,4 +59,22 @@ int LinuxOs::EjectDevice(int fd) {
   return Status(::ioctl(fd, CDROMEJECT));
 }
 
+int LinuxOs::MountedDevice(const char* path, uint64_t& device) {
+  struct statx status {};
+  if (::statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW, STATX_TYPE, &status) != 0) return -errno;
+  // Memory and pseudo file systems get numbers of the unnamed major 0: no device
+  // holds them, whatever the mount table names as their source.
+  if (status.stx_dev_major == 0) return -ENODEV;
+  device = makedev(status.stx_dev_major, status.stx_dev_minor);
+  return 0;
+}
+
+int LinuxOs::DeviceNumber(int fd, uint64_t& device) {
+  struct stat status {};
+  if (::fstat(fd, &status) != 0) return -errno;
+  if (!S_ISBLK(status.st_mode)) return -ENOTBLK;
+  device = status.st_rdev;
+  return 0;
+}
+
 }  // namespace brisvale::os

@@ -1,5 +1,8 @@
 // The daemon in a sandbox root, driven over its real socket.
+#include <sys/resource.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
 #include <sys/un.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -7,10 +10,15 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <csignal>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 
+#include "base/unique_fd.h"
 #include "platform/linux/ipc_client.h"
+#include "platform/linux/ipc_frame.h"
 #include "sandbox_daemon.h"
 
 namespace brisvale::testing {
@@ -77,6 +85,74 @@ TEST_F(DaemonTest, CallerWhoseExecutableCarriesTheEntitlementIsServedQuietly) {
   EXPECT_THAT(daemon.LogLines(), Not(Contains(::testing::HasSubstr("entitlement"))));
 }
 
+// A process that connects without the entitlement and then execs a program that has it
+// is served without: the daemon goes by the program that connected.
+TEST_F(DaemonTest, ExecAfterConnectIsServedWithoutEntitlements) {
+  const std::string client = daemon.root() + ".entitled-ctl";
+  std::filesystem::copy_file(BRISVALE_CTL_PATH, client, std::filesystem::copy_options::overwrite_existing);
+  const std::string entitlements = plist::WriteXml(
+      plist::Dictionary{{"com.vantrel.private.brisvale.allowedSPI", plist::Array{"SyncDevice"}}});
+  if (setxattr(client.c_str(), "trusted.vexa.entitlements", entitlements.data(), entitlements.size(), 0) != 0) {
+    std::filesystem::remove(client);
+    GTEST_SKIP() << "trusted extended attributes unsupported here";
+  }
+  int pass[2];
+  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pass), 0);
+  const pid_t child = fork();
+  if (child == 0) {
+    const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::snprintf(address.sun_path, sizeof address.sun_path, "%s", daemon.ServiceSocket().c_str());
+    if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) _exit(2);
+    // Hands the connection to the test, then becomes the entitled program.
+    char control[CMSG_SPACE(sizeof(int))] = {};
+    char byte = 0;
+    iovec data{&byte, 1};
+    msghdr message{};
+    message.msg_iov = &data;
+    message.msg_iovlen = 1;
+    message.msg_control = control;
+    message.msg_controllen = sizeof control;
+    CMSG_FIRSTHDR(&message)->cmsg_level = SOL_SOCKET;
+    CMSG_FIRSTHDR(&message)->cmsg_type = SCM_RIGHTS;
+    CMSG_FIRSTHDR(&message)->cmsg_len = CMSG_LEN(sizeof(int));
+    std::memcpy(CMSG_DATA(CMSG_FIRSTHDR(&message)), &fd, sizeof fd);
+    if (sendmsg(pass[1], &message, 0) != 1) _exit(3);
+    execl(client.c_str(), client.c_str(), "--root", daemon.root().c_str(), "watch", static_cast<char*>(nullptr));
+    _exit(4);
+  }
+  char control[CMSG_SPACE(sizeof(int))] = {};
+  char byte = 0;
+  iovec data{&byte, 1};
+  msghdr message{};
+  message.msg_iov = &data;
+  message.msg_iovlen = 1;
+  message.msg_control = control;
+  message.msg_controllen = sizeof control;
+  ASSERT_EQ(recvmsg(pass[0], &message, 0), 1);
+  UniqueFd connection;
+  int received = -1;
+  std::memcpy(&received, CMSG_DATA(CMSG_FIRSTHDR(&message)), sizeof received);
+  connection.Reset(received);
+  const std::string exe = "/proc/" + std::to_string(child) + "/exe";
+  for (int i = 0; i < 200 && std::filesystem::read_symlink(exe).string() != client; ++i) usleep(10000);
+
+  const auto frame = ipc::EncodeFrame(plist::Dictionary{
+      {"EncodedDictionary", plist::Value(plist::WriteBinary(plist::Dictionary{{"RequestType", "Sync"}}))}});
+  ASSERT_TRUE(frame);
+  EXPECT_EQ(send(connection.get(), frame->data(), frame->size(), MSG_NOSIGNAL), static_cast<ssize_t>(frame->size()));
+  EXPECT_TRUE(daemon.WaitForLogLine("default: Serving pid " + std::to_string(child) +
+                                    " without entitlements: it no longer runs the program that connected"));
+  EXPECT_TRUE(daemon.WaitForLogLine(
+      "default: Missing required entitlement (will be required in <kelpie://problem/25909614>): SyncDevice"));
+  kill(child, SIGKILL);
+  waitpid(child, nullptr, 0);
+  close(pass[0]);
+  close(pass[1]);
+  std::filesystem::remove(client);
+}
+
 TEST_F(DaemonTest, HardwareEventsAreLoggedByName) {
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.example.unknown").ok());
   EXPECT_TRUE(daemon.WaitForLogLine("debug: Unsupported Kestrix Event: com.vantrel.example.unknown"));
@@ -107,6 +183,130 @@ TEST(DaemonActivation, SocketPassedByTheLauncherIsServed) {
       std::chrono::seconds(10));
   EXPECT_TRUE(reply.ok()) << reply.error;
   unlink(path.c_str());
+}
+
+// What the daemon holds: open descriptors and anonymous memory (KiB).
+std::pair<size_t, long> Holdings(pid_t pid) {
+  const std::string proc = "/proc/" + std::to_string(pid);
+  const auto descriptors = std::distance(std::filesystem::directory_iterator(proc + "/fd"),
+                                         std::filesystem::directory_iterator());
+  long rssAnon = -1;
+  std::ifstream status(proc + "/status");
+  for (std::string line; std::getline(status, line);) {
+    if (line.starts_with("RssAnon:")) rssAnon = std::stol(line.substr(8));
+  }
+  return {static_cast<size_t>(descriptors), rssAnon};
+}
+
+// In a child running as `uid`: opens `count` idle connections to `path` and, once they
+// are all made, runs `then` and exits with its status.
+pid_t AsUser(uid_t uid, const std::string& path, int count, const std::function<int()>& then) {
+  const pid_t pid = fork();
+  if (pid != 0) return pid;
+  rlimit files{};
+  getrlimit(RLIMIT_NOFILE, &files);
+  files.rlim_cur = files.rlim_max;
+  setrlimit(RLIMIT_NOFILE, &files);
+  if (setgid(uid) != 0 || setuid(uid) != 0) _exit(2);
+  for (int i = 0; i < count; ++i) {
+    const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
+    if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) _exit(3);
+  }
+  _exit(then());
+}
+
+int ExitStatus(pid_t pid) {
+  int status = 0;
+  waitpid(pid, &status, 0);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+// 1,000 idle connections of one unprivileged user under a limit of 1,024 descriptors:
+// the surplus is refused with a line, root is served meanwhile, and once they are gone
+// the user is served again.
+TEST_F(DaemonTest, IdleCrowdCannotStopTheService) {
+  constexpr uid_t kNobody = 65534;
+  ASSERT_EQ(chmod(daemon.root().c_str(), 0755), 0);
+  const rlimit limit{1024, 1024};
+  ASSERT_EQ(prlimit(daemon.pid(), RLIMIT_NOFILE, &limit, nullptr), 0);
+  const auto before = Holdings(daemon.pid());
+  int release[2], ready[2];
+  ASSERT_EQ(pipe(release), 0);
+  ASSERT_EQ(pipe(ready), 0);
+  const pid_t crowd = AsUser(kNobody, daemon.ServiceSocket(), 1000, [&] {
+    char byte = 0;
+    close(release[1]);
+    if (write(ready[1], &byte, 1) != 1) return 4;
+    return read(release[0], &byte, 1) == 0 ? 0 : 4;  // until the test lets go
+  });
+  close(release[0]);
+  close(ready[1]);
+  char byte;
+  ASSERT_EQ(read(ready[0], &byte, 1), 1);
+  close(ready[0]);
+  // Root's connection queues behind the crowd's and is served once they are taken in.
+  std::optional<plist::Value> reply;
+  EXPECT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}, &reply).ok());
+  const auto during = Holdings(daemon.pid());
+  EXPECT_TRUE(daemon.LogContains(
+      "default: Refusing a vexa connection of uid 65534: 64 open of 64 for one user, 64 of 256 in all"));
+  close(release[1]);
+  EXPECT_EQ(ExitStatus(crowd), 0);
+  // One more than before: the mount table the first listing opened stays open.
+  for (int i = 0; i < 500 && Holdings(daemon.pid()).first > before.first + 1; ++i) usleep(10000);
+
+  const std::string path = daemon.ServiceSocket();
+  const pid_t single = AsUser(kNobody, path, 0, [&] {
+    auto client = ipc::Client::Connect(path);
+    const plist::Bytes request = plist::WriteBinary(plist::Dictionary{{"RequestType", "CopyDevices"}});
+    return client && client->Request({{"EncodedDictionary", plist::Value(request)}}, std::chrono::seconds(10)).ok()
+               ? 0 : 5;
+  });
+  EXPECT_EQ(ExitStatus(single), 0);
+  const auto after = Holdings(daemon.pid());
+  EXPECT_LE(during.first, 1024u);
+  EXPECT_LE(after.first, before.first + 2);
+  std::printf("descriptors %zu/%zu/%zu, RssAnon KiB %ld/%ld/%ld (before/during/after)\n", before.first,
+              during.first, after.first, before.second, during.second, after.second);
+}
+
+// 64 connections that each send half of a 4 MB frame and stop: past the budget of all
+// connections they are cancelled, the daemon stays small, and gives the memory back.
+TEST_F(DaemonTest, ParkedHalfFramesStayWithinTheBudget) {
+  const auto before = Holdings(daemon.pid());
+  std::vector<UniqueFd> parked;
+  const std::vector<uint8_t> half(2'000'000, 'x');
+  for (int i = 0; i < 64; ++i) {
+    UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::snprintf(address.sun_path, sizeof address.sun_path, "%s", daemon.ServiceSocket().c_str());
+    ASSERT_EQ(connect(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    const uint8_t header[4] = {0x00, 0x3D, 0x09, 0x00};  // 4,000,000 bytes follow
+    bool open = send(fd.get(), header, sizeof header, MSG_NOSIGNAL) == 4;
+    for (size_t sent = 0; open && sent < half.size();) {
+      const ssize_t n = send(fd.get(), half.data() + sent, half.size() - sent, MSG_NOSIGNAL);
+      open = n > 0;
+      sent += n > 0 ? static_cast<size_t>(n) : 0;
+    }
+    parked.push_back(std::move(fd));
+  }
+  EXPECT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}).ok());
+  const auto during = Holdings(daemon.pid());
+  parked.clear();
+  EXPECT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}).ok());
+  usleep(200000);
+  const auto after = Holdings(daemon.pid());
+  EXPECT_LT(during.second, before.second + 40 * 1024);  // the 32 MiB budget and what is being read
+  EXPECT_LE(after.second, before.second + 1024);
+  bool cancelled = false;
+  for (const std::string& line : daemon.LogLines()) cancelled |= line.find("over the budget") != std::string::npos;
+  EXPECT_TRUE(cancelled);
+  std::printf("descriptors %zu/%zu/%zu, RssAnon KiB %ld/%ld/%ld (before/during/after)\n", before.first,
+              during.first, after.first, before.second, during.second, after.second);
 }
 
 }  // namespace

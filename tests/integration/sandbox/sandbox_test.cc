@@ -137,6 +137,16 @@ TEST_F(SandboxRoot, MountsMadeInsideShowOutsideAndTeardownClearsThemAndNothingEl
   ASSERT_EQ(mkdir((dir_ + "/private/var/mnt/held").c_str(), 0755), 0);
   ASSERT_EQ(mount(outside.c_str(), (dir_ + "/private/var/mnt/held").c_str(), nullptr, MS_BIND, nullptr), 0);
   ASSERT_EQ(symlink(outside.c_str(), (dir_ + "/private/var/link").c_str()), 0);
+  // A tree far deeper than a path may be long.
+  int deep = open((dir_ + "/private/var/mnt").c_str(), O_RDONLY | O_DIRECTORY);
+  for (int level = 0; level < 10000 && deep >= 0; ++level) {
+    mkdirat(deep, "d", 0755);
+    const int next = openat(deep, "d", O_RDONLY | O_DIRECTORY);
+    close(deep);
+    deep = next;
+  }
+  ASSERT_GE(deep, 0);
+  close(deep);
 
   std::string loop = InChild([&] {
     std::string failed = Enter(dir_);

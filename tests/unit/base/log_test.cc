@@ -6,7 +6,10 @@
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
+#include <chrono>
 #include <thread>
+
+#include "base/utf8.h"
 
 namespace brisvale::log {
 namespace {
@@ -68,6 +71,42 @@ TEST(LogFormat, Conversions) {
   for (const FormatCase& c : cases) {
     EXPECT_EQ(Format(c.format, c.args), c.expected) << c.name;
   }
+}
+
+// Hostile values: whatever their size or sharing, a line stays within its bound, ends
+// in the cut mark, keeps whole characters and costs no more than the bound to build.
+TEST(LogFormat, LongValuesAreCutEarly) {
+  const Value shared = Value(plist::Bytes(64 * 1024, 0xAB));
+  const Value thousandReferences = Value(plist::Array(1000, shared));
+  const std::string longText(100000, 'x');
+  std::string utf8;
+  for (int i = 0; i < 5000; ++i) utf8 += "\xC3\xA9";
+  const Value nested = Value(plist::Array(1000, thousandReferences));
+  struct Case {
+    const char* name;
+    std::string format;
+    std::vector<Arg> args;
+    size_t maxLength;
+  };
+  const std::vector<Case> cases = {
+      {"shared data", "Invalid value for %@: %@", {"MountPath", thousandReferences}, kMaxValueLength + 40},
+      {"nested sharing", "%@", {nested}, kMaxValueLength + 8},
+      {"long %s", "%s", {longText}, kMaxValueLength + 8},
+      {"many long values", "%@ %@ %@ %@ %@ %@", {longText, longText, longText, longText, longText, longText},
+       kMaxLineLength + 8},
+      {"cut inside a character", "%@", {utf8}, kMaxValueLength + 8},
+  };
+  for (const Case& c : cases) {
+    const auto start = std::chrono::steady_clock::now();
+    const std::string line = Format(c.format, c.args);
+    const auto took = std::chrono::steady_clock::now() - start;
+    EXPECT_LE(line.size(), c.maxLength) << c.name;
+    EXPECT_TRUE(line.ends_with(plist::kDescriptionCut)) << c.name;
+    EXPECT_TRUE(utf8::IsValid(line)) << c.name;
+    EXPECT_LT(took, std::chrono::milliseconds(200)) << c.name;  // 2 s when walked in full
+  }
+  // Short values are untouched.
+  EXPECT_EQ(Format("%@", {Value(plist::Array(2, Value(plist::Bytes{1})))}), "[<01>, <01>]");
 }
 
 TEST(LogCapture, RecordsLevelsGatesDebugAndRestoresWhatWasBefore) {

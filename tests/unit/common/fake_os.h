@@ -38,6 +38,15 @@ class FakeOs : public os::Os {
   int SyncFilesystem(const char*) override { return -ENOSYS; }
   int OpenDevice(const char*) override { return -ENOSYS; }
   int EjectDevice(int) override { return -ENOSYS; }
+  // Every mount is held by device 1 and every node is device 1 unless a test says else.
+  int MountedDevice(const char*, uint64_t& device) override {
+    device = 1;
+    return 0;
+  }
+  int DeviceNumber(int, uint64_t& device) override {
+    device = 1;
+    return 0;
+  }
   int ReadDirectory(const char*, std::vector<os::DirectoryEntry>&) override { return -ENOSYS; }
   int RealPath(const char*, std::string&) override { return -ENOSYS; }
   int ClearFlags(const char*) override { return -ENOSYS; }
@@ -53,6 +62,9 @@ class FakeOs : public os::Os {
   int OpenFile(const char*) override { return -ENOSYS; }
   int FileSize(int, uint64_t&) override { return -ENOSYS; }
   int MapFile(int, size_t, std::unique_ptr<os::FileMapping>&) override { return -ENOSYS; }
+  int UnlinkAt(int, const char*) override { return -ENOSYS; }
+  int RemoveDirectoryAt(int, const char*) override { return -ENOSYS; }
+  int ClearFlagsAt(int, const char*) override { return -ENOSYS; }
 };
 
 }  // namespace brisvale::testing

@@ -1,5 +1,6 @@
 // The start-up clean-up over real directories; only the mount table is made up.
 #include <fcntl.h>
+#include <sys/mount.h>
 #include <linux/fs.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
@@ -12,9 +13,11 @@
 #include <fstream>
 
 #include "base/log.h"
+#include "base/unique_fd.h"
 #include "daemon/stale_mount_points.h"
 #include "fake_os.h"
 #include "platform/linux/os_system.h"
+#include "platform/linux/os_tree_walk.h"
 #include "platform/services.h"
 #include "registry/registry_model.h"
 
@@ -38,8 +41,21 @@ class TreeOs : public testing::FakeOs {
   os::TreeWalk WalkTree(const char* root, const std::function<bool(const os::TreeNode&)>& visit) override {
     return real.WalkTree(root, visit);
   }
+  int UnlinkAt(int dir, const char* name) override { return real.UnlinkAt(dir, name); }
+  int RemoveDirectoryAt(int dir, const char* name) override { return real.RemoveDirectoryAt(dir, name); }
+  int ClearFlagsAt(int dir, const char* name) override { return real.ClearFlagsAt(dir, name); }
   os::LinuxOs real;
 };
+
+// Makes `depth` nested directories named "d" below `top`, without any path limit.
+void MakeDeepTree(const fs::path& top, int depth) {
+  UniqueFd dir(::open(top.c_str(), O_RDONLY | O_DIRECTORY));
+  for (int i = 0; i < depth && dir; ++i) {
+    ::mkdirat(dir.get(), "d", 0755);
+    dir = UniqueFd(::openat(dir.get(), "d", O_RDONLY | O_DIRECTORY));
+  }
+  ASSERT_TRUE(dir);
+}
 
 bool SetFlag(const fs::path& path, int flag) {
   const int fd = ::open(path.c_str(), O_RDONLY);
@@ -111,6 +127,64 @@ TEST_F(StaleMountPointsTest, MissingRootIsSilentOtherFailuresAreLogged) {
   EXPECT_EQ(RemoveTree((root / "keep-start").c_str(), 0), 0);
   EXPECT_TRUE(fs::exists(root / "keep-start"));
   EXPECT_FALSE(fs::exists(root / "keep-start/child"));
+
+  // A name that is no text cannot be looked up, so it counts as not mounted.
+  fs::create_directories(root / "stale-\xff/inner");
+  capture.Clear();
+  RemoveStaleMountPoints(root.c_str());
+  EXPECT_THAT(capture.Texts(), ::testing::Contains("Failed to create string."));
+  EXPECT_FALSE(fs::exists(root / "stale-\xff"));
+}
+
+// Each top entry is its own attack; the walk must survive all of them and touch nothing
+// outside the root: a same-device bind mount of an outside directory, a directory
+// swapped for a link to an outside one while the walk runs, a tree deeper than any path
+// may be long, and a start that is itself a link.
+TEST_F(StaleMountPointsTest, NothingOutsideTheRootIsTouched) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to bind mount";
+  // On a memory file system of its own: deep trees are slow to create and drop on disk.
+  ASSERT_EQ(::mount("tmpfs", base.c_str(), "tmpfs", 0, nullptr), 0);
+  struct Unmount {
+    std::string path;
+    ~Unmount() { ::umount2(path.c_str(), MNT_DETACH); }
+  } unmountBase{base.string()};
+  fs::create_directories(root);
+  const fs::path outside = base / "outside";
+  fs::create_directories(outside / "sub");
+  std::ofstream(outside / "precious") << "x";
+  std::ofstream(outside / "sub/precious") << "x";
+  fs::create_directories(root / "binds/bind");
+  ASSERT_EQ(::mount(outside.c_str(), (root / "binds/bind").c_str(), nullptr, MS_BIND, nullptr), 0);
+  fs::create_directories(root / "swaps/victim/inner");
+  std::ofstream(root / "swaps/victim/inner/file") << "x";
+  fs::create_directories(root / "deep");
+  MakeDeepTree(root / "deep", 10000);
+  const std::string victim = (root / "swaps/victim").string();
+  os::SetTreeWalkHookForTesting([&](const std::string& path) {
+    if (path != victim) return;
+    fs::rename(victim, base / "moved-victim");
+    fs::create_directory_symlink(outside, victim);
+  });
+
+  RemoveStaleMountPoints(root.c_str());
+  os::SetTreeWalkHookForTesting(nullptr);
+  const bool bindHeld = ::umount2((root / "binds/bind").c_str(), MNT_DETACH) == 0;
+  EXPECT_TRUE(bindHeld) << "the bind mount was removed";
+
+  EXPECT_TRUE(fs::exists(outside / "precious"));
+  EXPECT_TRUE(fs::exists(outside / "sub/precious"));
+  EXPECT_TRUE(fs::exists(base / "moved-victim/inner/file"));
+  EXPECT_FALSE(fs::exists(root / "swaps"));
+  EXPECT_FALSE(fs::exists(root / "deep"));
+  const std::string bind = (root / "binds/bind").string();
+  EXPECT_THAT(capture.Texts(), ::testing::IsSupersetOf({"Failed to remove " + bind + ": 16",
+                                                        "Failed to delete " + (root / "binds").string() + "."}));
+
+  fs::create_directory_symlink(outside, root / "start-link");
+  capture.Clear();
+  EXPECT_EQ(RemoveTree((root / "start-link").c_str(), 1), -1);
+  EXPECT_THAT(capture.Texts(), ElementsAre("Failed to open path(s) for traversal: 40"));
+  EXPECT_TRUE(fs::exists(outside / "sub/precious"));
 }
 
 }  // namespace

@@ -40,6 +40,15 @@ class RecordingOs : public testing::FakeOs {
     calls.push_back("eject");
     return ejectResult;
   }
+  int mountedResult = 0, nodeNumber = 1;
+  int MountedDevice(const char*, uint64_t& device) override {
+    device = 1;
+    return mountedResult;
+  }
+  int DeviceNumber(int, uint64_t& device) override {
+    device = static_cast<uint64_t>(nodeNumber);
+    return 0;
+  }
   int SyncFilesystem(const char* path) override {
     calls.push_back(std::string("sync ") + path);
     return syncResult;
@@ -125,6 +134,11 @@ TEST_F(UnmountSyncTest, UnmountFailuresLogTheirLineAndLeaveTheRest) {
        {"Failed to open /dev/sdb1 : 2"}, 3, 1},
       {"eject fails", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::ejectResult, -ENOTTY, "Success",
        {"Failed to eject /dev/sdb1 : 25"}, 4, 1},
+      // The mount table's source names a device that does not hold the file system.
+      {"node is another device", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::nodeNumber, 2,
+       "Success", {"Failed to eject /dev/sdb1 : 19"}, 3, 1},
+      {"no device holds the mount", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::mountedResult,
+       -ENODEV, "Success", {"Failed to eject /dev/sdb1 : 19"}, 2, 1},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);

@@ -49,6 +49,30 @@ TEST_F(NotifyCenterTest, EverySubscriberGetsThePostWithItsUserInfo) {
   }
 }
 
+// Any datagram socket in the directory subscribes, whatever its name; what is not a
+// socket there is passed over.
+TEST_F(NotifyCenterTest, SocketsOfAnyNameGetThePost) {
+  std::vector<int> sockets;
+  for (const char* name : {"mine", "x.sock", "conformance-123"}) {
+    const int fd = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::snprintf(address.sun_path, sizeof address.sun_path, "%s/notify/%s", directory.c_str(), name);
+    ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0) << name;
+    sockets.push_back(fd);
+  }
+  fs::create_directory(directory + "/notify/sub-directory");
+  center->Post(Named("com.vantrel.brisvale_mounted"));
+  for (const int fd : sockets) {
+    char buffer[4096];
+    const ssize_t received = ::recv(fd, buffer, sizeof buffer, MSG_DONTWAIT);
+    ASSERT_GT(received, 0);
+    const auto notification = DecodeNotification({reinterpret_cast<uint8_t*>(buffer), static_cast<size_t>(received)});
+    EXPECT_EQ(notification ? notification->name : "", "com.vantrel.brisvale_mounted");
+    ::close(fd);
+  }
+}
+
 TEST_F(NotifyCenterTest, DeadSubscribersAreRemovedSlowOnesKept) {
   std::string error;
   auto slow = Subscriber::Create(directory + "/notify", &error);

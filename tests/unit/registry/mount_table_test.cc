@@ -3,6 +3,7 @@
 #include <unistd.h>
 
 #include <fstream>
+#include <string>
 
 #include "platform/linux/os_system.h"
 
@@ -19,16 +20,20 @@ TEST(MountTable, CountThenFillDecodesPathsAndReadsTheReadOnlyFlag) {
          "40 22 0:35 / /private/var/mnt/my\\040stick rw,nosuid - tmpfs tmp\\040fs rw\n"
          "41 22 7:3 / /Developer ro,nodev - ext4 /dev/loop3 ro\n"
          "42 22 7:4 / /private/var/factory_mount rw - erofs /dev/loop4 ro\n"
-         "43 22 0:36 / /proc rw - proc none rw\n";
+         "43 22 0:36 / /proc rw - proc none rw\n"
+         "44 22 0:37 / /" << std::string(1100, 'd') << " rw - fuse.a-very-long-type-name src rw\n";
 
-  EXPECT_EQ(ReadMountTable(name, {}), 5);
-  std::vector<MountRecord> records(6);
-  ASSERT_EQ(ReadMountTable(name, records), 5);
+  EXPECT_EQ(ReadMountTable(name, {}), 6);
+  std::vector<MountRecord> records(7);
+  ASSERT_EQ(ReadMountTable(name, records), 6);
   EXPECT_EQ(records[1], (MountRecord{0, "tmpfs", "/private/var/mnt/my stick", "tmp fs"}));
   EXPECT_EQ(records[2], (MountRecord{kMountReadOnly, "ext4", "/Developer", "/dev/loop3"}));
   // Read-only in the file system's own options counts too.
   EXPECT_EQ(records[3].flags, kMountReadOnly);
   EXPECT_EQ(records[0].flags, 0u);
+  // Paths are cut to 1023 bytes and type names to 15, as fixed-size fields hold them.
+  EXPECT_EQ(records[5].mountedOn, "/" + std::string(1022, 'd'));
+  EXPECT_EQ(records[5].typeName, "fuse.a-very-lon");
 
   // A buffer smaller than the table takes the first records only.
   std::vector<MountRecord> two(2);

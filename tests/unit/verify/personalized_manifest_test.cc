@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <limits>
 #include <ostream>
 
 #include "base/log.h"
@@ -160,6 +161,22 @@ TEST(EvaluateManifestProperty, UnhandledTagIsOnlyADebugNote) {
   Qor4PropertyRef ref{{property.data(), static_cast<uint32_t>(property.size())}, DERTagInteger};
   EXPECT_EQ(EvaluateManifestProperty(Qor4Code("XXXX"), ref, 0, &check), 0);
   EXPECT_EQ(capture.Lines(), (std::vector<log::Line>{{Level::Debug, "Unhandled manifest tag: XXXX"}}));
+}
+
+// Identity numbers stored as reals: only those an integer can hold convert.
+TEST(IdentityValue, RealsOutsideTheIntegerRangeAnswerNone) {
+  const std::pair<double, std::optional<uint64_t>> cases[] = {
+      {8.0, 8},
+      {-1.0, UINT64_MAX},
+      {18446744073709549568.0, 18446744073709549568ull},
+      {18446744073709551616.0, std::nullopt},
+      {-1e300, std::nullopt},
+      {std::numeric_limits<double>::quiet_NaN(), std::nullopt},
+      {std::numeric_limits<double>::infinity(), std::nullopt},
+  };
+  for (const auto& [real, expected] : cases) {
+    EXPECT_EQ(device::IdentityValue(plist::Value::Real(real)).int64(), expected) << real;
+  }
 }
 
 }  // namespace
