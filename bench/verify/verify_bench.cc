@@ -23,12 +23,17 @@
 
 #include "platform/crypto.h"
 #include "platform/device_properties.h"
+#include "platform/os.h"
+#include "platform/services.h"
 #include "verify/image_digest.h"
 #include "verify/personalized_manifest.h"
 
 namespace {
 
 namespace fs = std::filesystem;
+
+// The digests read the image through the services table.
+const brisvale::ScopedServices systemOs(brisvale::Services{.os = &brisvale::os::SystemOs()});
 using Bytes = std::vector<uint8_t>;
 
 // A temp directory for the run, removed at exit with everything in it.

@@ -9,13 +9,12 @@
 #include "base/utf8.h"
 #include "inventory/inventory.h"
 #include "inventory/paths.h"
+#include "platform/os.h"
 #include "platform/services.h"
 
 namespace brisvale {
 namespace {
 
-using log::Level;
-using log::Log;
 
 constexpr std::string_view kDiskImageDriveClass = "KxNimbrelHDDriveInKernel";
 
@@ -76,7 +75,7 @@ std::optional<MountEntry> CreateMapEntryFromMount(const os::MountRecord& record)
     Log(Level::Default, "Failed to retrieve the last path component for %@.", plist::Value(*url));
     return entry;
   }
-  if (name->size() >= paths::kPathBufferSize) {
+  if (name->size() >= os::kPathBufferSize) {
     Log(Level::Default, "Failed to create string.");
     return entry;
   }

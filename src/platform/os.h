@@ -15,6 +15,10 @@
 
 namespace brisvale::os {
 
+// Paths and names the core hands to the system are copied into buffers of this size,
+// terminator included; a longer one is a failure, never truncated.
+inline constexpr size_t kPathBufferSize = 1024;
+
 // Mount-table flags.
 inline constexpr uint32_t kMountReadOnly = 0x1;
 inline constexpr uint32_t kMountContentProtection = 0x80;  // never set on Linux
@@ -110,6 +114,15 @@ class Os {
   // another file system: a mount point inside the tree is visited but not descended
   // into. The visitor answers false to stop the walk.
   virtual TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) = 0;
+
+  // A read-only descriptor for a file's contents, owned by the caller, or -errno. The
+  // file is expected to be read front to back.
+  virtual int OpenFile(const char* path) = 0;
+  // The size in bytes of the file behind `fd`, or -errno.
+  virtual int64_t FileSize(int fd) = 0;
+  // Reads at most buffer.size() bytes from the file position, retrying when a signal
+  // interrupts: the count read (0 at the end of the file) or -errno.
+  virtual int64_t Read(int fd, std::span<uint8_t> buffer) = 0;
 };
 
 // The operating system this process runs on.

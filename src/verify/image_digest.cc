@@ -1,8 +1,5 @@
 #include "verify/image_digest.h"
 
-#include <fcntl.h>
-#include <unistd.h>
-
 #include <cerrno>
 #include <memory>
 #include <new>
@@ -10,24 +7,24 @@
 #include "base/log.h"
 #include "base/unique_fd.h"
 #include "platform/crypto.h"
+#include "platform/os.h"
+#include "platform/services.h"
 
 namespace brisvale::verify {
 namespace {
-
-using FileDescriptor = UniqueFd;
 
 std::optional<plist::Bytes> DigestFile(std::string_view path, crypto::DigestAlgorithm algorithm) {
   if (path.empty()) {
     Log(Level::Default, "Invalid input.");
     return std::nullopt;
   }
+  os::Os& os = *CurrentServices().os;
   std::string pathText(path);
-  FileDescriptor file(open(pathText.c_str(), O_RDONLY | O_CLOEXEC));
-  if (file.get() < 0) {
+  const UniqueFd file(os.OpenFile(pathText.c_str()));
+  if (!file) {
     Log(Level::Default, "Failed to create file handle for %@.", pathText);
     return std::nullopt;
   }
-  posix_fadvise(file.get(), 0, 0, POSIX_FADV_SEQUENTIAL);
 
   crypto::Hasher hasher(algorithm);
   std::unique_ptr<uint8_t[]> buffer(new (std::nothrow) uint8_t[kDigestReadSize]);
@@ -36,10 +33,9 @@ std::optional<plist::Bytes> DigestFile(std::string_view path, crypto::DigestAlgo
     return std::nullopt;
   }
   for (;;) {
-    ssize_t count = read(file.get(), buffer.get(), kDigestReadSize);
-    if (count < 0 && errno == EINTR) continue;
+    const int64_t count = os.Read(file.get(), {buffer.get(), kDigestReadSize});
     if (count < 0) {
-      Log(Level::Default, "Failed to read %@: %{errno}d", pathText, errno);
+      Log(Level::Default, "Failed to read %@: %{errno}d", pathText, static_cast<int>(-count));
       return std::nullopt;
     }
     if (count == 0) break;

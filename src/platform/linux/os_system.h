@@ -28,6 +28,10 @@ class LinuxOs final : public Os {
   int RealPath(const char* path, std::string& resolved) override;
   int ClearFlags(const char* path) override;
   TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) override;
+  // os_files.cc
+  int OpenFile(const char* path) override;
+  int64_t FileSize(int fd) override;
+  int64_t Read(int fd, std::span<uint8_t> buffer) override;
 
  private:
   UniqueFd mountInfo_;               // /proc/self/mountinfo, opened on first use

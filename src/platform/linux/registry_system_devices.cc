@@ -8,7 +8,7 @@
 #include "base/log.h"
 #include "base/runloop.h"
 #include "platform/linux/registry_sysfs.h"
-#include "platform/system_devices.h"
+#include "platform/linux/system_devices.h"
 
 namespace brisvale::registry {
 namespace {

@@ -15,7 +15,7 @@
 
 #include "base/runloop.h"
 #include "platform/os.h"
-#include "platform/system_devices.h"
+#include "platform/linux/system_devices.h"
 
 namespace brisvale::registry {
 namespace {

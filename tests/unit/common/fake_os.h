@@ -44,6 +44,9 @@ class FakeOs : public os::Os {
   os::TreeWalk WalkTree(const char*, const std::function<bool(const os::TreeNode&)>&) override {
     return {-ENOSYS, 0};
   }
+  int OpenFile(const char*) override { return -ENOSYS; }
+  int64_t FileSize(int) override { return -ENOSYS; }
+  int64_t Read(int, std::span<uint8_t>) override { return -ENOSYS; }
 };
 
 }  // namespace brisvale::testing

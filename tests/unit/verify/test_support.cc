@@ -16,9 +16,14 @@
 #include <stdexcept>
 
 #include "derwriter/der_writer.h"
+#include "platform/os.h"
+#include "platform/services.h"
 
 namespace brisvale::testing {
 namespace {
+
+// The verifiers read image and certificate files through the services table.
+const ScopedServices systemOs(Services{.os = &os::SystemOs()});
 
 template <auto Free>
 struct Deleter {
