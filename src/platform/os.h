@@ -6,6 +6,7 @@
 // failure, so the core logs the error number without reading errno.
 #pragma once
 
+#include <algorithm>
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -127,5 +128,18 @@ class Os {
 
 // The operating system this process runs on.
 Os& SystemOs();
+
+// The whole mount table through GetMountTable's count-then-fill, with room for one more
+// record than counted so that a mount made between the two calls still fits: the
+// number of records (0 when nothing is mounted) or -errno.
+inline int CopyMountTable(Os& os, std::vector<MountRecord>& records) {
+  records.clear();
+  const int counted = os.GetMountTable({});
+  if (counted < 1) return counted;
+  records.resize(static_cast<size_t>(counted) + 1);
+  const int filled = os.GetMountTable(records);
+  records.resize(filled < 0 ? 0 : std::min(records.size(), static_cast<size_t>(filled)));
+  return filled;
+}
 
 }  // namespace brisvale::os
