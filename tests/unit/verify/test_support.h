@@ -56,8 +56,8 @@ Bytes Resign(const Bytes& toBeSigned, const std::string& issuerKey, const EVP_MD
 Bytes ReplaceOnce(const Bytes& bytes, const std::string& fromHex, const std::string& toHex);
 Bytes FromHex(const std::string& hex);
 
-// PKCS#1 RSAPublicKey of a PEM key, and a PKCS#1 v1.5 signature over `digest` with it.
+// PKCS#1 RSAPublicKey of a PEM key. Signatures come from imgtool::SignDigest, the code
+// the image builders sign with.
 Bytes RsaPublicKeyOf(const std::string& keyPath);
-Bytes SignDigestWith(const std::string& keyPath, const EVP_MD* md, const Bytes& digest);
 
 }  // namespace brisvale::testing
