@@ -1,3 +1,4 @@
+// The daemon's serving state: listener, connections and hardware events over a fake transport.
 #include "daemon/daemon.h"
 
 #include <gmock/gmock.h>

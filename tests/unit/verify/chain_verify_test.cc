@@ -1,3 +1,4 @@
+// Certificate-chain and signature verification for the signed container, with the compiled-in roots.
 #include <gtest/gtest.h>
 
 #include "derwriter/der_writer.h"

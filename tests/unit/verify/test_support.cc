@@ -1,3 +1,4 @@
+// Fixtures for the verification tests: the signing tool and certificates minted with chosen defects.
 #include "test_support.h"
 
 #include <openssl/pem.h>
@@ -46,22 +47,6 @@ void Check(bool ok, const char* what) {
 
 std::string Pki(const std::string& name) { return std::string(BRISVALE_PKI_DIR) + "/" + name; }
 
-Bytes ReadBytes(const std::filesystem::path& path) { return imgtool::ReadFile(path); }
-
-void WriteBytes(const std::filesystem::path& path, const Bytes& bytes) {
-  imgtool::WriteFile(path, bytes);
-}
-
-ScratchDir::ScratchDir() {
-  std::string pattern = (std::filesystem::temp_directory_path() / "brisvale-verify-XXXXXX").string();
-  if (!mkdtemp(pattern.data())) throw std::runtime_error("mkdtemp failed");
-  path_ = pattern;
-}
-
-ScratchDir::~ScratchDir() {
-  std::error_code ignored;
-  std::filesystem::remove_all(path_, ignored);
-}
 
 bool RunImgtool(const std::vector<std::string>& args) {
   std::vector<char*> argv{const_cast<char*>(BRISVALE_IMGTOOL)};
