@@ -8,6 +8,7 @@
 #include <openssl/x509_vfy.h>
 
 #include "base/c_handle.h"
+#include "platform/crypto.h"
 
 namespace brisvale::openssl {
 
@@ -22,5 +23,15 @@ using X509StoreCtxPtr = CHandle<X509_STORE_CTX, X509_STORE_CTX_free>;
 // A stack that owns its certificates.
 inline void FreeX509Stack(STACK_OF(X509) * stack) { sk_X509_pop_free(stack, X509_free); }
 using X509StackPtr = CHandle<STACK_OF(X509), FreeX509Stack>;
+
+// OpenSSL's digest for one of the platform's algorithms.
+inline const EVP_MD* MessageDigest(crypto::DigestAlgorithm algorithm) {
+  switch (algorithm) {
+    case crypto::DigestAlgorithm::Sha1: return EVP_sha1();
+    case crypto::DigestAlgorithm::Sha256: return EVP_sha256();
+    case crypto::DigestAlgorithm::Sha384: return EVP_sha384();
+  }
+  return nullptr;
+}
 
 }  // namespace brisvale::openssl
