@@ -12,7 +12,7 @@ fi
 # The demo mounts and chroots: the rest runs as root, through sudo for a user who is
 # not (the build above stays the user's own).
 if [[ $(id -u) -ne 0 ]]; then
-  as_root env BRISVALE_DEMO_BUILT=1 "$0" "$@"
+  as_root env BRISVALE_DEMO_BUILT=1 "$PWD/scripts/demo.sh" "$@"
   exit
 fi
 

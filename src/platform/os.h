@@ -17,7 +17,7 @@
 namespace brisvale::os {
 
 // Paths and names the core hands to the system are copied into buffers of this size,
-// terminator included; a longer one is a failure, never truncated.
+// terminator included.
 inline constexpr size_t kPathBufferSize = 1024;
 
 // Mount-table flags.
