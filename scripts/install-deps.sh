@@ -2,6 +2,7 @@
 # Installs the Debian packages the build, the tests and the demo need; quick when
 # everything is already there.
 set -euo pipefail
+source "$(dirname "$0")/as-root.sh"
 
 packages=(
   cmake make g++ pkg-config python3
@@ -19,8 +20,5 @@ done
 [[ ${#missing[@]} -eq 0 ]] && exit 0
 
 echo "Installing: ${missing[*]}"
-sudo=""
-[[ $(id -u) -eq 0 ]] || sudo="sudo"
-export DEBIAN_FRONTEND=noninteractive
-$sudo apt-get update -qq
-$sudo apt-get install -y -qq --no-install-recommends "${missing[@]}"
+as_root env DEBIAN_FRONTEND=noninteractive apt-get update -qq
+as_root env DEBIAN_FRONTEND=noninteractive apt-get install -y -qq --no-install-recommends "${missing[@]}"

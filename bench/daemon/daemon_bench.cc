@@ -22,7 +22,7 @@
 namespace {
 
 using namespace brisvale;
-using testing::SandboxDaemon;
+using brisvale::testing::SandboxDaemon;
 
 plist::Dictionary SyncRequest() {
   return plist::Dictionary{

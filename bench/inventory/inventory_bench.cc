@@ -16,8 +16,8 @@ namespace brisvale {
 namespace {
 
 namespace fs = std::filesystem;
-using testing::LoopMount;
-using testing::SandboxDaemon;
+using brisvale::testing::LoopMount;
+using brisvale::testing::SandboxDaemon;
 
 constexpr int kMounts = 64;
 constexpr int kSticks = 32;

@@ -22,13 +22,19 @@
 #include <vector>
 
 #include "platform/crypto.h"
+#include "base/c_handle.h"
 #include "platform/device_properties.h"
+#include "platform/os.h"
+#include "platform/services.h"
 #include "verify/image_digest.h"
 #include "verify/personalized_manifest.h"
 
 namespace {
 
 namespace fs = std::filesystem;
+
+// The digests read the image through the services table.
+const brisvale::ScopedServices systemOs(brisvale::Services{.os = &brisvale::os::SystemOs()});
 using Bytes = std::vector<uint8_t>;
 
 // A temp directory for the run, removed at exit with everything in it.
@@ -157,12 +163,6 @@ void BM_VerifyPersonalizedManifest(benchmark::State& state) {
 }
 BENCHMARK(BM_VerifyPersonalizedManifest)->Unit(benchmark::kMicrosecond);
 
-template <auto Free>
-struct Deleter {
-  template <typename T>
-  void operator()(T* object) const { Free(object); }
-};
-
 Bytes DerFile(const std::string& name) { return ReadAll(std::string(BRISVALE_PKI_DIR) + "/" + name); }
 
 // What any implementation has to do for the same manifest: import the root's and the
@@ -175,7 +175,7 @@ void BM_OpensslBaseline(benchmark::State& state) {
   // The leaf's to-be-signed part and signature, and the body and its signature, are
   // located once; locating them is parsing, not the cryptography measured here.
   const unsigned char* cursor = leaf.data();
-  std::unique_ptr<X509, Deleter<X509_free>> leafCertificate(
+  brisvale::CHandle<X509, X509_free> leafCertificate(
       d2i_X509(nullptr, &cursor, static_cast<long>(leaf.size())));
   unsigned char* tbsDer = nullptr;
   int tbsLength = i2d_re_X509_tbs(leafCertificate.get(), &tbsDer);
@@ -210,7 +210,7 @@ void BM_OpensslBaseline(benchmark::State& state) {
   Bytes bodySignature(manifest.begin() + inner, manifest.begin() + offset + signatureSize);
 
   auto verify = [](EVP_PKEY* key, const Bytes& digest, const Bytes& signature) {
-    std::unique_ptr<EVP_PKEY_CTX, Deleter<EVP_PKEY_CTX_free>> ctx(
+    brisvale::CHandle<EVP_PKEY_CTX, EVP_PKEY_CTX_free> ctx(
         EVP_PKEY_CTX_new_from_pkey(nullptr, key, nullptr));
     return EVP_PKEY_verify_init(ctx.get()) == 1 &&
            EVP_PKEY_CTX_set_rsa_padding(ctx.get(), RSA_PKCS1_PADDING) == 1 &&
@@ -226,7 +226,7 @@ void BM_OpensslBaseline(benchmark::State& state) {
   // The keys as SubjectPublicKeyInfo, taken out of the certificates once.
   auto keyInfo = [](const Bytes& certificate) {
     const unsigned char* p = certificate.data();
-    std::unique_ptr<X509, Deleter<X509_free>> x509(
+    brisvale::CHandle<X509, X509_free> x509(
         d2i_X509(nullptr, &p, static_cast<long>(certificate.size())));
     unsigned char* der = nullptr;
     int length = i2d_PUBKEY(X509_get0_pubkey(x509.get()), &der);
@@ -237,7 +237,7 @@ void BM_OpensslBaseline(benchmark::State& state) {
   Bytes rootKeyInfo = keyInfo(root), leafKeyInfo = keyInfo(leaf);
   auto importKey = [](const Bytes& info) {
     const unsigned char* p = info.data();
-    return std::unique_ptr<EVP_PKEY, Deleter<EVP_PKEY_free>>(
+    return brisvale::CHandle<EVP_PKEY, EVP_PKEY_free>(
         d2i_PUBKEY(nullptr, &p, static_cast<long>(info.size())));
   };
   for (auto _ : state) {
@@ -260,7 +260,7 @@ void BM_PrimitiveFloor(benchmark::State& state) {
   auto components = [](const std::string& name) {
     Bytes der = DerFile(name);
     const unsigned char* p = der.data();
-    std::unique_ptr<X509, Deleter<X509_free>> x509(d2i_X509(nullptr, &p, static_cast<long>(der.size())));
+    brisvale::CHandle<X509, X509_free> x509(d2i_X509(nullptr, &p, static_cast<long>(der.size())));
     BIGNUM* n = nullptr;
     BIGNUM* e = nullptr;
     EVP_PKEY_get_bn_param(X509_get0_pubkey(x509.get()), "n", &n);

@@ -1,11 +1,12 @@
 // An owned file descriptor: closed when its owner goes, on every path.
 #pragma once
 
-#include <unistd.h>
-
 #include <utility>
 
 namespace brisvale {
+
+// close(2), kept out of this header so that including it brings in no system header.
+void CloseFd(int fd);
 
 class UniqueFd {
  public:
@@ -25,7 +26,7 @@ class UniqueFd {
   // Gives up ownership without closing.
   int release() { return std::exchange(fd_, -1); }
   void Reset(int fd = -1) {
-    if (fd_ >= 0) ::close(fd_);
+    if (fd_ >= 0) CloseFd(fd_);
     fd_ = fd;
   }
 

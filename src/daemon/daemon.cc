@@ -19,12 +19,12 @@ void RefreshRegistry(registry::RefreshReason reason) {
 
 }  // namespace
 
-Daemon::Daemon(RunLoop& loop, ipc::IpcService& ipc, MatchingContext& context,
-               std::function<void(int)> exitProcess)
-    : loop_(loop), ipc_(ipc), context_(context), exitProcess_(std::move(exitProcess)) {}
+Daemon::Daemon(RunLoop& loop, MatchingContext& context, std::function<void(int)> exitProcess)
+    : loop_(loop), context_(context), exitProcess_(std::move(exitProcess)) {}
 
 bool Daemon::StartServing() {
-  listener_ = ipc_.CreateListener(kServiceName);
+  ipc::IpcService& ipc = *CurrentServices().ipc;
+  listener_ = ipc.CreateListener(kServiceName);
   if (!listener_) {
     Log(Level::Default, "Failed to create vexa listener for %s.", kServiceName);
     return false;
@@ -32,7 +32,7 @@ bool Daemon::StartServing() {
   listener_->Resume([this](std::shared_ptr<ipc::Connection> connection, ipc::EventKind kind) {
     HandleListenerEvent(std::move(connection), kind);
   });
-  hardwareEvents_ = ipc_.RegisterEventStream(
+  hardwareEvents_ = ipc.RegisterEventStream(
       kHardwareEventStream, [this](const ipc::StreamEvent& event) { HandleHardwareEvent(event); });
   return true;
 }

@@ -23,9 +23,9 @@ inline constexpr const char* kStaleMountRoots[] = {"/var/mnt", "/private/var/fac
 
 class Daemon {
  public:
-  // `exitProcess` ends the process; tests replace it.
-  Daemon(RunLoop& loop, ipc::IpcService& ipc, MatchingContext& context,
-         std::function<void(int status)> exitProcess);
+  // `exitProcess` ends the process; tests replace it. The transport, like every other
+  // platform service, comes from CurrentServices().
+  Daemon(RunLoop& loop, MatchingContext& context, std::function<void(int status)> exitProcess);
 
   // Creates the listener and registers the hardware event stream. Returns false after
   // logging when the listener cannot be created (the caller exits with status 1).
@@ -40,7 +40,6 @@ class Daemon {
 
  private:
   RunLoop& loop_;
-  ipc::IpcService& ipc_;
   MatchingContext& context_;
   std::function<void(int)> exitProcess_;
   std::unique_ptr<ipc::Listener> listener_;

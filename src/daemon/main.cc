@@ -22,7 +22,7 @@
 #include "platform/linux/registry_disk_images.h"
 #include "platform/os.h"
 #include "platform/services.h"
-#include "platform/system_devices.h"
+#include "platform/linux/system_devices.h"
 #include "registry/registry_model.h"
 #include "registry/simulated_devices.h"
 
@@ -165,7 +165,7 @@ int main(int argc, char** argv) {
 
   for (const char* root : kStaleMountRoots) RemoveStaleMountPoints(root);
 
-  Daemon daemon(loop, *ipc, context, [](int status) { std::exit(status); });
+  Daemon daemon(loop, context, [](int status) { std::exit(status); });
   if (!daemon.StartServing()) return 1;
   loop.Run();
   return 0;

@@ -9,13 +9,7 @@
 
 namespace brisvale {
 
-namespace {
-constexpr size_t kPathBufferSize = 1024;
-}
-
 void HandleSync(const plist::Value& request, plist::Dictionary& reply) {
-  using log::Level;
-  using log::Log;
   const plist::Value* mountPath = request.get("MountPath");
   if (!mountPath || !mountPath->string()) {
     Log(Level::Default, "Failed to extract %@ from request", plist::Value("MountPath"));
@@ -27,7 +21,7 @@ void HandleSync(const plist::Value& request, plist::Dictionary& reply) {
     return;
   }
   const std::string& path = *mountPath->string();
-  if (path.size() > kPathBufferSize || path.find('\0') != std::string::npos) {
+  if (path.size() > os::kPathBufferSize || path.find('\0') != std::string::npos) {
     Log(Level::Default, "Failed to create string.");
     return;
   }

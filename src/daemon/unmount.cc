@@ -16,8 +16,6 @@
 namespace brisvale {
 namespace {
 
-using log::Level;
-using log::Log;
 
 constexpr const char* kUnmountedNotification = "com.vantrel.brisvale_unmounted";
 // Mount points under this prefix are fixed directories of the system image.

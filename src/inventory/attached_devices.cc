@@ -7,14 +7,13 @@
 #include "inventory/inventory.h"
 #include "inventory/paths.h"
 #include "media/cameras.h"
+#include "platform/os.h"
 #include "media/fs_identify.h"
 #include "platform/services.h"
 
 namespace brisvale {
 namespace {
 
-using log::Level;
-using log::Log;
 
 constexpr std::string_view kEfiSystemPartition = "C12A7328-F81F-11D2-BA4B-00A0C93EC93B";
 constexpr std::string_view kPartitionMap = "Vantrel_partition_map";
@@ -44,7 +43,7 @@ std::optional<MountEntry> EntryForMedia(const registry::ObjectRef& media, std::s
     return std::nullopt;
   }
   devicePath = "/dev/" + *bsdName->string();
-  if (devicePath.size() >= paths::kPathBufferSize) {
+  if (devicePath.size() >= os::kPathBufferSize) {
     Log(Level::Default, "Failed to create string.");
     return std::nullopt;
   }

@@ -9,13 +9,12 @@
 #include "base/utf8.h"
 #include "inventory/inventory.h"
 #include "inventory/paths.h"
+#include "platform/os.h"
 #include "platform/services.h"
 
 namespace brisvale {
 namespace {
 
-using log::Level;
-using log::Log;
 
 constexpr std::string_view kDiskImageDriveClass = "KxNimbrelHDDriveInKernel";
 
@@ -76,7 +75,7 @@ std::optional<MountEntry> CreateMapEntryFromMount(const os::MountRecord& record)
     Log(Level::Default, "Failed to retrieve the last path component for %@.", plist::Value(*url));
     return entry;
   }
-  if (name->size() >= paths::kPathBufferSize) {
+  if (name->size() >= os::kPathBufferSize) {
     Log(Level::Default, "Failed to create string.");
     return entry;
   }
@@ -134,19 +133,12 @@ std::optional<std::string> CopySignatureTextFromImagePath(std::string_view image
 std::optional<DeviceMap> CopyMountedFilesystemMap() {
   DeviceMap map;
   os::Os& os = *CurrentServices().os;
-  const int counted = os.GetMountTable({});
-  if (counted < 1) {
-    Log(Level::Default, "Failed to get mount information: %{errno}d", counted < 0 ? -counted : 0);
+  std::vector<os::MountRecord> records;
+  const int count = os::CopyMountTable(os, records);
+  if (count < 1) {
+    Log(Level::Default, "Failed to get mount information: %{errno}d", count < 0 ? -count : 0);
     return map;
   }
-  // One record more than counted, so a mount made between the two calls still fits.
-  std::vector<os::MountRecord> records(static_cast<size_t>(counted) + 1);
-  const int filled = os.GetMountTable(records);
-  if (filled < 1) {
-    Log(Level::Default, "Failed to get mount information: %{errno}d", filled < 0 ? -filled : 0);
-    return map;
-  }
-  records.resize(std::min(records.size(), static_cast<size_t>(filled)));
 
   for (const os::MountRecord& record : records) {
     std::optional<MountEntry> entry = CreateMapEntryFromMount(record);

@@ -12,9 +12,6 @@
 
 namespace brisvale::paths {
 
-// Paths and names are copied into buffers of this size, terminator included.
-inline constexpr size_t kPathBufferSize = 1024;
-
 // `text` read as a URL string: none when it is empty or holds a character a URL may
 // not carry unescaped (space, controls, non-ASCII, <>"{}|\^` or a stray '%').
 std::optional<std::string> UrlFromText(std::string_view text);

@@ -7,8 +7,6 @@
 // Message's body: handlers see only the dictionary the client sent.
 #pragma once
 
-#include <sys/types.h>
-
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -58,8 +56,9 @@ class Connection {
   // Closes the connection; the handler then gets one ConnectionInvalid event.
   virtual void Cancel() = 0;
 
-  virtual pid_t PeerPid() const = 0;
-  virtual uid_t PeerUid() const = 0;
+  // The system's pid_t and uid_t, which are these widths on every platform we build for.
+  virtual int32_t PeerPid() const = 0;
+  virtual uint32_t PeerUid() const = 0;
   // The caller's executable path; empty when it cannot be found.
   virtual std::string PeerExecutablePath() const = 0;
   // The value of the named entitlement of the caller's executable; none when absent.

@@ -7,6 +7,7 @@
 #pragma once
 
 #include <cerrno>
+#include <algorithm>
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -17,6 +18,10 @@
 #include <vector>
 
 namespace brisvale::os {
+
+// Paths and names the core hands to the system are copied into buffers of this size,
+// terminator included.
+inline constexpr size_t kPathBufferSize = 1024;
 
 // Mount-table flags.
 inline constexpr uint32_t kMountReadOnly = 0x1;
@@ -206,9 +211,13 @@ class Os {
   virtual int UserHomeDirectory(uint32_t uid, std::string& home) = 0;
   // At most `maxLength` bytes from the start of the file at `path`.
   virtual int ReadFile(const char* path, size_t maxLength, std::vector<uint8_t>& contents) = 0;
-  // A read-only descriptor for the file at `path`, owned by the caller, or -errno.
+  // A read-only descriptor for the file at `path`, owned by the caller, or -errno. The
+  // file is expected to be read front to back.
   virtual int OpenFile(const char* path) = 0;
   virtual int FileSize(int fd, uint64_t& size) = 0;
+  // Reads at most buffer.size() bytes at `offset`, retrying when a signal interrupts:
+  // the count read (0 at the end of the file) or -errno.
+  virtual int64_t Read(int fd, std::span<uint8_t> buffer, uint64_t offset) = 0;
   // Maps the first `length` bytes of `fd` read-only and private.
   virtual int MapFile(int fd, size_t length, std::unique_ptr<FileMapping>& mapping) = 0;
 
@@ -221,5 +230,18 @@ class Os {
 
 // The operating system this process runs on.
 Os& SystemOs();
+
+// The whole mount table through GetMountTable's count-then-fill, with room for one more
+// record than counted so that a mount made between the two calls still fits: the
+// number of records (0 when nothing is mounted) or -errno.
+inline int CopyMountTable(Os& os, std::vector<MountRecord>& records) {
+  records.clear();
+  const int counted = os.GetMountTable({});
+  if (counted < 1) return counted;
+  records.resize(static_cast<size_t>(counted) + 1);
+  const int filled = os.GetMountTable(records);
+  records.resize(filled < 0 ? 0 : std::min(records.size(), static_cast<size_t>(filled)));
+  return filled;
+}
 
 }  // namespace brisvale::os

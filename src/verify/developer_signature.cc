@@ -1,9 +1,5 @@
 #include "verify/developer_signature.h"
 
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <cerrno>
 #include <cmath>
 #include <memory>
@@ -13,45 +9,38 @@
 
 #include "base/log.h"
 #include "base/unique_fd.h"
+#include "platform/os.h"
+#include "platform/services.h"
 
 namespace brisvale::verify {
-namespace {
-
-// Paths go through a buffer of this size, terminator included.
-constexpr size_t kPathBufferSize = 1024;
-
-using FileDescriptor = UniqueFd;
-
-}  // namespace
 
 std::optional<certtrust::Certificate> CopyCertificateFromPEMFile(std::string_view path) {
-  if (path.empty() || path.size() >= kPathBufferSize) {
+  if (path.empty() || path.size() >= os::kPathBufferSize) {
     Log(Level::Default, "Failed to create string.");
     return std::nullopt;
   }
+  os::Os& os = *CurrentServices().os;
   std::string pathText(path);
-  FileDescriptor file(open(pathText.c_str(), O_RDONLY | O_CLOEXEC));
-  if (file.get() < 0) {
-    Log(Level::Default, "Failed to open %s: %{errno}d", pathText, errno);
+  const int fd = os.OpenFile(pathText.c_str());
+  if (fd < 0) {
+    Log(Level::Default, "Failed to open %s: %{errno}d", pathText, -fd);
     return std::nullopt;
   }
-  struct stat status;
-  if (fstat(file.get(), &status) != 0) {
-    Log(Level::Default, "Failed to fstat %s: %{errno}d", pathText, errno);
+  const UniqueFd file(fd);
+  uint64_t fileSize = 0;
+  if (const int rc = os.FileSize(file.get(), fileSize); rc < 0) {
+    Log(Level::Default, "Failed to fstat %s: %{errno}d", pathText, -rc);
     return std::nullopt;
   }
-  size_t size = static_cast<size_t>(status.st_size);
+  const size_t size = static_cast<size_t>(fileSize);
   std::unique_ptr<uint8_t[]> bytes(new (std::nothrow) uint8_t[size ? size : 1]);
   if (!bytes) {
     Log(Level::Default, "Failed to allocate memory: %{errno}d", ENOMEM);
     return std::nullopt;
   }
-  ssize_t count;
-  do {
-    count = read(file.get(), bytes.get(), size);
-  } while (count < 0 && errno == EINTR);
+  const int64_t count = os.Read(file.get(), {bytes.get(), size}, 0);
   if (count < 0 || static_cast<size_t>(count) != size) {
-    Log(Level::Default, "Failed to read %s: %{errno}d", pathText, count < 0 ? errno : 0);
+    Log(Level::Default, "Failed to read %s: %{errno}d", pathText, count < 0 ? static_cast<int>(-count) : 0);
     return std::nullopt;
   }
   std::optional<certtrust::Certificate> certificate =

@@ -1,8 +1,5 @@
 #include "verify/image_digest.h"
 
-#include <fcntl.h>
-#include <unistd.h>
-
 #include <cerrno>
 #include <memory>
 #include <new>
@@ -10,32 +7,31 @@
 #include "base/log.h"
 #include "base/unique_fd.h"
 #include "platform/crypto.h"
+#include "platform/os.h"
+#include "platform/services.h"
 
 namespace brisvale::verify {
 namespace {
-
-using FileDescriptor = UniqueFd;
 
 // Reads from offset 0 whatever the descriptor's position, so the caller's own
 // descriptor can be digested as it is.
 std::optional<plist::Bytes> DigestDescriptor(int fd, const std::string& pathText,
                                              crypto::DigestAlgorithm algorithm) {
-  posix_fadvise(fd, 0, 0, POSIX_FADV_SEQUENTIAL);
+  os::Os& os = *CurrentServices().os;
   crypto::Hasher hasher(algorithm);
   std::unique_ptr<uint8_t[]> buffer(new (std::nothrow) uint8_t[kDigestReadSize]);
   if (!buffer) {
     Log(Level::Default, "Failed to allocate memory: %{errno}d", ENOMEM);
     return std::nullopt;
   }
-  for (off_t offset = 0;;) {
-    ssize_t count = pread(fd, buffer.get(), kDigestReadSize, offset);
-    if (count < 0 && errno == EINTR) continue;
+  for (uint64_t offset = 0;;) {
+    const int64_t count = os.Read(fd, {buffer.get(), kDigestReadSize}, offset);
     if (count < 0) {
-      Log(Level::Default, "Failed to read %@: %{errno}d", pathText, errno);
+      Log(Level::Default, "Failed to read %@: %{errno}d", pathText, static_cast<int>(-count));
       return std::nullopt;
     }
     if (count == 0) break;
-    offset += count;
+    offset += static_cast<uint64_t>(count);
     if (!hasher.Update({buffer.get(), static_cast<size_t>(count)})) break;
   }
   plist::Bytes digest(crypto::DigestLength(algorithm));
@@ -52,8 +48,8 @@ std::optional<plist::Bytes> DigestFile(std::string_view path, crypto::DigestAlgo
     return std::nullopt;
   }
   std::string pathText(path);
-  FileDescriptor file(open(pathText.c_str(), O_RDONLY | O_CLOEXEC));
-  if (file.get() < 0) {
+  const UniqueFd file(CurrentServices().os->OpenFile(pathText.c_str()));
+  if (!file) {
     Log(Level::Default, "Failed to create file handle for %@.", pathText);
     return std::nullopt;
   }

@@ -11,23 +11,17 @@
 namespace brisvale::imgtool {
 namespace {
 
-template <auto Free>
-struct Deleter {
-  template <typename T>
-  void operator()(T* object) const { Free(object); }
-};
+using openssl::PkeyPtr;
 
-using PkeyPtr = std::unique_ptr<EVP_PKEY, Deleter<EVP_PKEY_free>>;
+}  // namespace
 
 PkeyPtr LoadPrivateKey(const std::string& keyPath) {
-  std::unique_ptr<FILE, Deleter<fclose>> file(std::fopen(keyPath.c_str(), "rb"));
+  CHandle<FILE, fclose> file(std::fopen(keyPath.c_str(), "rb"));
   if (!file) throw ToolError("cannot open key " + keyPath);
   PkeyPtr key(PEM_read_PrivateKey(file.get(), nullptr, nullptr, nullptr));
   if (!key) throw ToolError("not a PEM private key: " + keyPath);
   return key;
 }
-
-}  // namespace
 
 const EVP_MD* DigestNamed(const std::string& name) {
   if (name == "sha1") return EVP_sha1();
@@ -39,7 +33,7 @@ const EVP_MD* DigestNamed(const std::string& name) {
 Bytes DigestOfFile(const std::string& path, const EVP_MD* md) {
   std::ifstream file(path, std::ios::binary);
   if (!file) throw ToolError("cannot open " + path);
-  std::unique_ptr<EVP_MD_CTX, Deleter<EVP_MD_CTX_free>> ctx(EVP_MD_CTX_new());
+  openssl::MdCtxPtr ctx(EVP_MD_CTX_new());
   if (!ctx || EVP_DigestInit_ex(ctx.get(), md, nullptr) != 1) throw ToolError("digest failed");
   std::vector<char> buffer(1 << 20);
   while (file) {
@@ -65,8 +59,7 @@ Bytes DigestOfBytes(const Bytes& bytes, const EVP_MD* md) {
 
 Bytes SignDigest(const std::string& keyPath, const EVP_MD* md, const Bytes& digest) {
   PkeyPtr key = LoadPrivateKey(keyPath);
-  std::unique_ptr<EVP_PKEY_CTX, Deleter<EVP_PKEY_CTX_free>> ctx(
-      EVP_PKEY_CTX_new(key.get(), nullptr));
+  openssl::PkeyCtxPtr ctx(EVP_PKEY_CTX_new(key.get(), nullptr));
   if (!ctx || EVP_PKEY_sign_init(ctx.get()) != 1 ||
       EVP_PKEY_CTX_set_signature_md(ctx.get(), md) != 1) {
     throw ToolError("cannot sign with " + keyPath);
@@ -94,18 +87,17 @@ Bytes MintLeafCertificate(const std::string& issuerKey, const std::string& issue
   PkeyPtr subjectKey = LoadPrivateKey(leafKey);
   Bytes issuerDer = ReadFile(issuerCertificate);
   const unsigned char* cursor = issuerDer.data();
-  std::unique_ptr<X509, Deleter<X509_free>> issuer(
+  openssl::X509Ptr issuer(
       d2i_X509(nullptr, &cursor, static_cast<long>(issuerDer.size())));
   if (!issuer) throw ToolError("not a DER certificate: " + issuerCertificate);
 
   Bytes oidDer{0x06, static_cast<uint8_t>(oidContent.size())};
   oidDer.insert(oidDer.end(), oidContent.begin(), oidContent.end());
   cursor = oidDer.data();
-  std::unique_ptr<ASN1_OBJECT, Deleter<ASN1_OBJECT_free>> oid(
+  CHandle<ASN1_OBJECT, ASN1_OBJECT_free> oid(
       d2i_ASN1_OBJECT(nullptr, &cursor, static_cast<long>(oidDer.size())));
-  std::unique_ptr<ASN1_OCTET_STRING, Deleter<ASN1_OCTET_STRING_free>> value(
-      ASN1_OCTET_STRING_new());
-  std::unique_ptr<X509, Deleter<X509_free>> leaf(X509_new());
+  CHandle<ASN1_OCTET_STRING, ASN1_OCTET_STRING_free> value(ASN1_OCTET_STRING_new());
+  openssl::X509Ptr leaf(X509_new());
   const unsigned char commonName[] = "Brisvale Development Pinned Signer";
   bool built =
       oidContent.size() < 128 && oid && value && leaf &&
@@ -120,7 +112,7 @@ Bytes MintLeafCertificate(const std::string& issuerKey, const std::string& issue
       ASN1_TIME_set_string(X509_getm_notAfter(leaf.get()), "20400101000000Z") == 1 &&
       X509_set_pubkey(leaf.get(), subjectKey.get()) == 1;
   if (built) {
-    std::unique_ptr<X509_EXTENSION, Deleter<X509_EXTENSION_free>> extension(
+    CHandle<X509_EXTENSION, X509_EXTENSION_free> extension(
         X509_EXTENSION_create_by_OBJ(nullptr, oid.get(), 0, value.get()));
     built = extension && X509_add_ext(leaf.get(), extension.get(), -1) == 1 &&
             X509_sign(leaf.get(), signer.get(), md) > 0;

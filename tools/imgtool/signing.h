@@ -7,8 +7,11 @@
 #include <string>
 
 #include "imgtool/options.h"
+#include "platform/linux/openssl_handles.h"
 
 namespace brisvale::imgtool {
+
+openssl::PkeyPtr LoadPrivateKey(const std::string& keyPath);  // a PEM private key
 
 const EVP_MD* DigestNamed(const std::string& name);  // "sha1", "sha256", "sha384"
 Bytes DigestOfFile(const std::string& path, const EVP_MD* md);

@@ -1,49 +1,32 @@
 // Message digests over OpenSSL's EVP interface.
 #include <openssl/evp.h>
 
-#include <memory>
-
 #include "platform/crypto.h"
+#include "platform/linux/openssl_handles.h"
 
 namespace brisvale::crypto {
 
-namespace {
-
-struct MdContextFree {
-  void operator()(EVP_MD_CTX* context) const { EVP_MD_CTX_free(context); }
-};
-using MdContext = std::unique_ptr<EVP_MD_CTX, MdContextFree>;
-
-const EVP_MD* Md(DigestAlgorithm algorithm) {
-  switch (algorithm) {
-    case DigestAlgorithm::Sha1: return EVP_sha1();
-    case DigestAlgorithm::Sha256: return EVP_sha256();
-    case DigestAlgorithm::Sha384: return EVP_sha384();
-  }
-  return nullptr;
-}
-
-}  // namespace
+using openssl::MessageDigest;
 
 bool Digest(DigestAlgorithm algorithm, std::span<const uint8_t> input, std::span<uint8_t> out) {
   const size_t length = DigestLength(algorithm);
   if (out.size() < length) return false;
   unsigned int written = 0;
-  if (EVP_Digest(input.data(), input.size(), out.data(), &written, Md(algorithm), nullptr) != 1) {
+  if (EVP_Digest(input.data(), input.size(), out.data(), &written, MessageDigest(algorithm), nullptr) != 1) {
     return false;
   }
   return written == length;
 }
 
 struct Hasher::State {
-  MdContext context;
+  openssl::MdCtxPtr context;
   bool failed = false;
 };
 
 Hasher::Hasher(DigestAlgorithm algorithm) : algorithm_(algorithm), state_(new State) {
   state_->context.reset(EVP_MD_CTX_new());
   state_->failed = state_->context == nullptr ||
-                   EVP_DigestInit_ex(state_->context.get(), Md(algorithm), nullptr) != 1;
+                   EVP_DigestInit_ex(state_->context.get(), MessageDigest(algorithm), nullptr) != 1;
 }
 
 Hasher::~Hasher() = default;

@@ -19,14 +19,7 @@ std::span<const uint8_t> WithoutLeadingZeros(std::span<const uint8_t> number) {
   return number.subspan(skip);
 }
 
-const EVP_MD* MessageDigest(DigestAlgorithm algorithm) {
-  switch (algorithm) {
-    case DigestAlgorithm::Sha1: return EVP_sha1();
-    case DigestAlgorithm::Sha256: return EVP_sha256();
-    case DigestAlgorithm::Sha384: return EVP_sha384();
-  }
-  return nullptr;
-}
+using openssl::MessageDigest;
 
 openssl::PkeyPtr PublicKeyFromParams(const char* type, OSSL_PARAM* params) {
   openssl::PkeyCtxPtr ctx(EVP_PKEY_CTX_new_from_name(nullptr, type, nullptr));

@@ -10,17 +10,11 @@
 #include <memory>
 #include <vector>
 
+#include "base/c_handle.h"
 #include "platform/linux/os_system.h"
 
 namespace brisvale::os {
 namespace {
-
-struct TableDeleter {
-  void operator()(libmnt_table* table) const { mnt_unref_table(table); }
-};
-struct IterDeleter {
-  void operator()(libmnt_iter* iter) const { mnt_free_iter(iter); }
-};
 
 bool HasOption(const char* options, const char* name) {
   char* value = nullptr;
@@ -36,8 +30,8 @@ struct FileCloser {
 
 // Parses a table in the kernel's mountinfo format from `stream`.
 int ParseMountTable(FILE* stream, std::vector<MountRecord>& records) {
-  std::unique_ptr<libmnt_table, TableDeleter> table(mnt_new_table());
-  std::unique_ptr<libmnt_iter, IterDeleter> iter(mnt_new_iter(MNT_ITER_FORWARD));
+  CHandle<libmnt_table, mnt_unref_table> table(mnt_new_table());
+  CHandle<libmnt_iter, mnt_free_iter> iter(mnt_new_iter(MNT_ITER_FORWARD));
   if (!table || !iter) return -ENOMEM;
   // The parser decodes the table's octal escapes (a space is written \040).
   if (int rc = mnt_table_parse_stream(table.get(), stream, "mountinfo"); rc != 0) return rc < 0 ? rc : -EINVAL;

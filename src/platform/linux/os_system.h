@@ -54,6 +54,7 @@ class LinuxOs final : public Os {
   int ReadFile(const char* path, size_t maxLength, std::vector<uint8_t>& contents) override;
   int OpenFile(const char* path) override;
   int FileSize(int fd, uint64_t& size) override;
+  int64_t Read(int fd, std::span<uint8_t> buffer, uint64_t offset) override;
   int MapFile(int fd, size_t length, std::unique_ptr<FileMapping>& mapping) override;
   // os_files_below.cc
   int ReadFilesBelow(const char* directory, size_t maxFileBytes,

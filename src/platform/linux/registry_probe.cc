@@ -15,14 +15,11 @@
 #include <cstring>
 #include <memory>
 
+#include "base/c_handle.h"
 #include "base/log.h"
 
 namespace brisvale::registry::sysfs {
 namespace {
-
-struct ProbeDeleter {
-  void operator()(blkid_probe probe) const { blkid_free_probe(probe); }
-};
 
 using Fd = UniqueFd;
 
@@ -47,7 +44,7 @@ std::string PartitionContent(const char* gptTypeGuid, int mbrType) {
 }
 
 std::optional<PartitionTable> ProbePartitionTable(const std::string& node) {
-  std::unique_ptr<blkid_struct_probe, ProbeDeleter> probe(
+  CHandle<blkid_struct_probe, blkid_free_probe> probe(
       blkid_new_probe_from_filename(node.c_str()));
   if (!probe) return std::nullopt;
   PartitionTable table;

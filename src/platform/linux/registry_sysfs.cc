@@ -8,16 +8,12 @@
 #include <memory>
 #include <set>
 
+#include "base/c_handle.h"
+
 namespace brisvale::registry::sysfs {
 namespace {
 
-struct UdevDeviceDeleter {
-  void operator()(udev_device* device) const { udev_device_unref(device); }
-};
-struct UdevEnumerateDeleter {
-  void operator()(udev_enumerate* enumerate) const { udev_enumerate_unref(enumerate); }
-};
-using DevicePtr = std::unique_ptr<udev_device, UdevDeviceDeleter>;
+using DevicePtr = CHandle<udev_device, udev_device_unref>;
 
 std::string_view Text(const char* text) { return text ? std::string_view(text) : std::string_view(); }
 
@@ -43,7 +39,7 @@ void SetNumber(plist::Dictionary& properties, const char* key, udev_device* devi
 
 std::vector<std::string> SyspathsOf(udev* context, const char* subsystem) {
   std::vector<std::string> paths;
-  std::unique_ptr<udev_enumerate, UdevEnumerateDeleter> enumerate(udev_enumerate_new(context));
+  CHandle<udev_enumerate, udev_enumerate_unref> enumerate(udev_enumerate_new(context));
   if (!enumerate) return paths;
   udev_enumerate_add_match_subsystem(enumerate.get(), subsystem);
   udev_enumerate_scan_devices(enumerate.get());

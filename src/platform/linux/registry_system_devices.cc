@@ -5,27 +5,19 @@
 #include <map>
 #include <set>
 
+#include "base/c_handle.h"
 #include "base/log.h"
 #include "base/runloop.h"
 #include "platform/linux/registry_sysfs.h"
-#include "platform/system_devices.h"
+#include "platform/linux/system_devices.h"
 
 namespace brisvale::registry {
 namespace {
 
 constexpr int kEventBufferBytes = 4 << 20;
 
-struct UdevDeleter {
-  void operator()(udev* context) const { udev_unref(context); }
-};
-struct MonitorDeleter {
-  void operator()(udev_monitor* monitor) const { udev_monitor_unref(monitor); }
-};
-struct DeviceDeleter {
-  void operator()(udev_device* device) const { udev_device_unref(device); }
-};
-using UdevPtr = std::unique_ptr<udev, UdevDeleter>;
-using MonitorPtr = std::unique_ptr<udev_monitor, MonitorDeleter>;
+using UdevPtr = CHandle<udev, udev_unref>;
+using MonitorPtr = CHandle<udev_monitor, udev_monitor_unref>;
 
 MonitorPtr OpenKernelEvents(udev* context) {
   MonitorPtr monitor(udev_monitor_new_from_netlink(context, "kernel"));
@@ -82,7 +74,7 @@ class LinuxSystemDevices final : public SystemDevices {
     bool changed = false;
     for (;;) {
       errno = 0;
-      std::unique_ptr<udev_device, DeviceDeleter> event(
+      CHandle<udev_device, udev_device_unref> event(
           udev_monitor_receive_device(monitor_.get()));
       if (!event) {
         // A full socket buffer drops events: only a rescan can tell what they were.

@@ -1,3 +1,4 @@
+// Ext4 images built with mkfs.ext4 and loop-mounted for the integration tests.
 #include "loop_mount.h"
 
 #include <fcntl.h>

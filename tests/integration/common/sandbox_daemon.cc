@@ -1,3 +1,4 @@
+// Starts, talks to and tears down the real daemon in a throw-away sandbox root.
 #include "sandbox_daemon.h"
 
 #include <fcntl.h>

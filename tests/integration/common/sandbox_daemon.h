@@ -13,15 +13,9 @@
 #include "base/plist.h"
 #include "platform/linux/ipc_client.h"
 
-namespace brisvale::testing {
+#include "test_files.h"
 
-// Skips the current test unless running as root.
-#define BRISVALE_REQUIRE_ROOT()                                             \
-  do {                                                                      \
-    if (geteuid() != 0) {                                                   \
-      GTEST_SKIP() << "needs root: mounts, loop devices, chroot";           \
-    }                                                                       \
-  } while (0)
+namespace brisvale::testing {
 
 class SandboxDaemon {
  public:

@@ -1,4 +1,4 @@
-// The sysfs provider and the mount table against the real kernel: a loop device and
+// The sysfs provider against the real kernel: a loop device and
 // tmpfs mounts. Needs root; every test skips itself otherwise.
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -14,7 +14,8 @@
 #include "base/runloop.h"
 #include "platform/linux/loop_device.h"
 #include "platform/os.h"
-#include "platform/system_devices.h"
+#include "platform/linux/system_devices.h"
+#include "test_files.h"
 
 namespace brisvale::registry {
 namespace {
@@ -24,24 +25,7 @@ namespace fs = std::filesystem;
 
 constexpr const char* kIdentifier = "5D1C2E0F-7A8B-4C9D-AE1F-203142536475";
 
-#define SKIP_UNLESS_ROOT() \
-  if (geteuid() != 0) GTEST_SKIP() << "needs root (loop devices, mknod, mount)"
-
-class TempDir {
- public:
-  TempDir() {
-    char name[] = "/tmp/brisvale-registry-XXXXXX";
-    path_ = mkdtemp(name) ? name : "";
-  }
-  ~TempDir() {
-    std::error_code ignored;
-    fs::remove_all(path_, ignored);
-  }
-  const std::string& path() const { return path_; }
-
- private:
-  std::string path_;
-};
+using testing::ScratchDir;
 
 // A read-only loop device over `image`, detached again when the guard goes.
 class LoopDevice {
@@ -63,21 +47,6 @@ class LoopDevice {
   loop::LoopDevice device_;
 };
 
-class Mount {
- public:
-  Mount(const std::string& source, const std::string& target, unsigned long flags)
-      : target_(target), mounted_(mount(source.c_str(), target.c_str(), "tmpfs", flags,
-                                        "size=1m") == 0) {}
-  ~Mount() {
-    if (mounted_) umount2(target_.c_str(), MNT_DETACH);
-  }
-  bool mounted() const { return mounted_; }
-
- private:
-  std::string target_;
-  bool mounted_;
-};
-
 std::string MakeExt4Image(const std::string& dir) {
   std::string image = dir + "/image.ext4";
   std::string command = "mkfs.ext4 -q -F " + image + " 4M >/dev/null 2>&1";
@@ -91,16 +60,16 @@ class SystemDevicesTest : public ::testing::Test {
     return model.GetMatchingService(Matching::BsdName(name));
   }
 
-  TempDir dir;
+  ScratchDir dir;
   RunLoop loop;
   RegistryModel model;
 };
 
 TEST_F(SystemDevicesTest, AttachedLoopDeviceIsPublishedBelowItsDriveAndTerminatedOnDetach) {
-  SKIP_UNLESS_ROOT();
-  std::string devRoot = dir.path() + "/dev";
+  BRISVALE_REQUIRE_ROOT();
+  std::string devRoot = dir.str() + "/dev";
   ASSERT_TRUE(fs::create_directory(devRoot));
-  std::string image = MakeExt4Image(dir.path());
+  std::string image = MakeExt4Image(dir.str());
   ASSERT_FALSE(image.empty()) << "mkfs.ext4 failed";
 
   auto devices = StartSystemDevices(model, &loop, {devRoot});
@@ -159,8 +128,8 @@ TEST_F(SystemDevicesTest, AttachedLoopDeviceIsPublishedBelowItsDriveAndTerminate
 }
 
 TEST_F(SystemDevicesTest, RefreshTakesInADeviceAttachedAMomentAgo) {
-  SKIP_UNLESS_ROOT();
-  std::string image = MakeExt4Image(dir.path());
+  BRISVALE_REQUIRE_ROOT();
+  std::string image = MakeExt4Image(dir.str());
   ASSERT_FALSE(image.empty());
   auto devices = StartSystemDevices(model, nullptr, {});  // no loop: only Refresh reads events
   ASSERT_NE(devices, nullptr);
@@ -184,35 +153,6 @@ TEST_F(SystemDevicesTest, RefreshTakesInADeviceAttachedAMomentAgo) {
     model.Refresh(RefreshReason::Request);
   }
   EXPECT_TRUE(media->IsTerminated());
-}
-
-TEST_F(SystemDevicesTest, MountTableShowsDecodedPathsAndTheReadOnlyFlag) {
-  SKIP_UNLESS_ROOT();
-  std::string spaced = dir.path() + "/with space";
-  std::string readOnly = dir.path() + "/read-only";
-  ASSERT_TRUE(fs::create_directory(spaced));
-  ASSERT_TRUE(fs::create_directory(readOnly));
-  Mount first("brisvale test", spaced, 0);
-  Mount second("brisvale-ro", readOnly, MS_RDONLY);
-  ASSERT_TRUE(first.mounted() && second.mounted());
-
-  os::Os& system = os::SystemOs();
-  int count = system.GetMountTable({});
-  ASSERT_GT(count, 1);
-  std::vector<os::MountRecord> records(static_cast<size_t>(count) + 1);
-  int filled = system.GetMountTable(records);
-  ASSERT_GT(filled, 1);
-  records.resize(static_cast<size_t>(filled));
-  auto find = [&](const std::string& path) {
-    return std::find_if(records.begin(), records.end(),
-                        [&](const os::MountRecord& r) { return r.mountedOn == path; });
-  };
-  auto spacedRecord = find(spaced);
-  ASSERT_NE(spacedRecord, records.end());
-  EXPECT_EQ(*spacedRecord, (os::MountRecord{0, "tmpfs", spaced, "brisvale test"}));
-  auto readOnlyRecord = find(readOnly);
-  ASSERT_NE(readOnlyRecord, records.end());
-  EXPECT_EQ(readOnlyRecord->flags, os::kMountReadOnly);
 }
 
 }  // namespace

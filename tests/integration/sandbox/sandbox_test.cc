@@ -1,3 +1,4 @@
+// The sandbox root: what it sets up inside, what shows outside, and its teardown.
 #include "platform/linux/os_sandbox.h"
 
 #include <fcntl.h>

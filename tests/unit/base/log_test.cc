@@ -1,3 +1,4 @@
+// Logging: printf conversions with the %@ and %{errno}d extensions, the capture sink, the stderr prefixes.
 #include "base/log.h"
 
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// The main loop: its queue, descriptor sources, timers and the background queue.
 #include "base/runloop.h"
 
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// The daemon's serving state: listener, connections and hardware events over a fake transport.
 #include "daemon/daemon.h"
 
 #include <gmock/gmock.h>
@@ -6,6 +7,7 @@
 #include "base/log.h"
 #include "base/runloop.h"
 #include "fake_connection.h"
+#include "platform/services.h"
 
 namespace brisvale {
 namespace {
@@ -49,9 +51,15 @@ class FakeIpc : public ipc::IpcService {
 struct DaemonTest : ::testing::Test {
   RunLoop loop;
   FakeIpc ipc;
+  // The other services stay those the test binary installed.
+  ScopedServices services{[this] {
+    Services withFakeIpc = CurrentServices();
+    withFakeIpc.ipc = &ipc;
+    return withFakeIpc;
+  }()};
   MatchingContext context;
   std::vector<int> exits;
-  Daemon daemon{loop, ipc, context, [this](int status) { exits.push_back(status); }};
+  Daemon daemon{loop, context, [this](int status) { exits.push_back(status); }};
 };
 
 TEST_F(DaemonTest, ListenerFailureIsLogged) {

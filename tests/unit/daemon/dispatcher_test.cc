@@ -1,3 +1,4 @@
+// The request dispatcher: decoding, entitlement checks, routing and the binary reply.
 #include "daemon/dispatcher.h"
 
 #include <gmock/gmock.h>

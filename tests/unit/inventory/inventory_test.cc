@@ -1,3 +1,4 @@
+// The inventory over a registry model and a fake mount table: map entries and lookups.
 #include "inventory/inventory.h"
 
 #include <gmock/gmock.h>

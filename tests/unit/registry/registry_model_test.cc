@@ -1,3 +1,4 @@
+// The in-process device registry: matching, iterators, notifications, interest and termination.
 #include "registry/registry_model.h"
 
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// The simulated device provider: devices files published, reloaded and refused.
 #include "registry/simulated_devices.h"
 
 #include <gtest/gtest.h>

@@ -1,6 +1,8 @@
+// Certificate-chain and signature verification for the signed container, with the compiled-in roots.
 #include <gtest/gtest.h>
 
 #include "derwriter/der_writer.h"
+#include "imgtool/signing.h"
 #include "platform/crypto.h"
 #include "test_support.h"
 #include "verify/chain/secure_boot.h"
@@ -188,7 +190,7 @@ TEST(SignatureVerify, RsaModulusUpTo4096Bits) {
   } cases[] = {{"secure-leaf.key", 0}, {"rsa-4104.key", -1}};
   for (const Case& c : cases) {
     Bytes key = testing::RsaPublicKeyOf(Pki(c.key));
-    Bytes signature = testing::SignDigestWith(Pki(c.key), EVP_sha384(), digest);
+    Bytes signature = imgtool::SignDigest(Pki(c.key), EVP_sha384(), digest);
     EXPECT_EQ(verify_signature_rsa(key.data(), static_cast<uint32_t>(key.size()), signature.data(),
                                    static_cast<uint32_t>(signature.size()), digest.data(), 48,
                                    &kQor4DecodeSecureBootRsa4kSha384, nullptr),
@@ -197,7 +199,7 @@ TEST(SignatureVerify, RsaModulusUpTo4096Bits) {
   }
   // The digest length must be the set's.
   Bytes key = testing::RsaPublicKeyOf(Pki("secure-leaf.key"));
-  Bytes signature = testing::SignDigestWith(Pki("secure-leaf.key"), EVP_sha384(), digest);
+  Bytes signature = imgtool::SignDigest(Pki("secure-leaf.key"), EVP_sha384(), digest);
   EXPECT_EQ(verify_signature_rsa(key.data(), static_cast<uint32_t>(key.size()), signature.data(),
                                  static_cast<uint32_t>(signature.size()), digest.data(), 48,
                                  &kQor4DecodeSecureBootRsa1kSha1, nullptr),

@@ -1,3 +1,4 @@
+// The developer-image signature check: certificate files, trust at the fixed instant, the RSA signature.
 #include "verify/developer_signature.h"
 
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// Image file digests: SHA-1 and SHA-384 chosen by length, and the failure lines.
 #include "verify/image_digest.h"
 
 #include <gtest/gtest.h>

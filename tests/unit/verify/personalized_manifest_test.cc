@@ -1,3 +1,4 @@
+// The personalized manifest check against the device identity and the image digest.
 #include "verify/personalized_manifest.h"
 
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// Fixtures for the verification tests: the signing tool and certificates minted with chosen defects.
 #include "test_support.h"
 
 #include <openssl/pem.h>
@@ -16,25 +17,19 @@
 #include <stdexcept>
 
 #include "derwriter/der_writer.h"
+#include "imgtool/signing.h"
+#include "platform/os.h"
+#include "platform/services.h"
 
 namespace brisvale::testing {
 namespace {
 
-template <auto Free>
-struct Deleter {
-  template <typename T>
-  void operator()(T* object) const { Free(object); }
-};
-using PkeyPtr = std::unique_ptr<EVP_PKEY, Deleter<EVP_PKEY_free>>;
-using X509Ptr = std::unique_ptr<X509, Deleter<X509_free>>;
+// The verifiers read image and certificate files through the services table.
+const ScopedServices systemOs(Services{.os = &os::SystemOs()});
 
-PkeyPtr LoadKey(const std::string& path) {
-  std::unique_ptr<FILE, Deleter<fclose>> file(std::fopen(path.c_str(), "rb"));
-  if (!file) throw std::runtime_error("cannot open " + path);
-  PkeyPtr key(PEM_read_PrivateKey(file.get(), nullptr, nullptr, nullptr));
-  if (!key) throw std::runtime_error("bad key " + path);
-  return key;
-}
+using imgtool::LoadPrivateKey;
+using openssl::PkeyPtr;
+using openssl::X509Ptr;
 
 X509Ptr LoadDer(const std::string& path) {
   Bytes der = ReadBytes(path);
@@ -52,28 +47,6 @@ void Check(bool ok, const char* what) {
 
 std::string Pki(const std::string& name) { return std::string(BRISVALE_PKI_DIR) + "/" + name; }
 
-Bytes ReadBytes(const std::filesystem::path& path) {
-  std::ifstream file(path, std::ios::binary);
-  if (!file) throw std::runtime_error("cannot read " + path.string());
-  return Bytes((std::istreambuf_iterator<char>(file)), std::istreambuf_iterator<char>());
-}
-
-void WriteBytes(const std::filesystem::path& path, const Bytes& bytes) {
-  std::ofstream file(path, std::ios::binary | std::ios::trunc);
-  file.write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
-  if (!file.flush()) throw std::runtime_error("cannot write " + path.string());
-}
-
-ScratchDir::ScratchDir() {
-  std::string pattern = (std::filesystem::temp_directory_path() / "brisvale-verify-XXXXXX").string();
-  if (!mkdtemp(pattern.data())) throw std::runtime_error("mkdtemp failed");
-  path_ = pattern;
-}
-
-ScratchDir::~ScratchDir() {
-  std::error_code ignored;
-  std::filesystem::remove_all(path_, ignored);
-}
 
 bool RunImgtool(const std::vector<std::string>& args) {
   std::vector<char*> argv{const_cast<char*>(BRISVALE_IMGTOOL)};
@@ -90,8 +63,8 @@ bool RunImgtool(const std::vector<std::string>& args) {
 }
 
 Bytes MintCertificate(const CertificateRecipe& recipe) {
-  PkeyPtr issuerKey = LoadKey(recipe.issuerKey);
-  PkeyPtr subjectKey = LoadKey(recipe.subjectKey);
+  PkeyPtr issuerKey = LoadPrivateKey(recipe.issuerKey);
+  PkeyPtr subjectKey = LoadPrivateKey(recipe.subjectKey);
   X509Ptr issuer = LoadDer(recipe.issuerCertificate);
   X509Ptr certificate(X509_new());
   Check(certificate && X509_set_version(certificate.get(), X509_VERSION_3), "version");
@@ -107,15 +80,14 @@ Bytes MintCertificate(const CertificateRecipe& recipe) {
         "validity");
   Check(X509_set_pubkey(certificate.get(), subjectKey.get()), "key");
   if (recipe.paddingExtensionSize > 0) {
-    std::unique_ptr<ASN1_OBJECT, Deleter<ASN1_OBJECT_free>> oid(
+    CHandle<ASN1_OBJECT, ASN1_OBJECT_free> oid(
         OBJ_txt2obj("1.3.6.1.4.1.57264.9.9", 1));
-    std::unique_ptr<ASN1_OCTET_STRING, Deleter<ASN1_OCTET_STRING_free>> value(
-        ASN1_OCTET_STRING_new());
+    CHandle<ASN1_OCTET_STRING, ASN1_OCTET_STRING_free> value(ASN1_OCTET_STRING_new());
     Bytes filler(recipe.paddingExtensionSize, 0x5A);
     Check(oid && value &&
               ASN1_OCTET_STRING_set(value.get(), filler.data(), static_cast<int>(filler.size())),
           "filler");
-    std::unique_ptr<X509_EXTENSION, Deleter<X509_EXTENSION_free>> extension(
+    CHandle<X509_EXTENSION, X509_EXTENSION_free> extension(
         X509_EXTENSION_create_by_OBJ(nullptr, oid.get(), 0, value.get()));
     Check(extension && X509_add_ext(certificate.get(), extension.get(), -1), "extension");
   }
@@ -149,7 +121,7 @@ Bytes Resign(const Bytes& toBeSigned, const std::string& issuerKey, const EVP_MD
   Bytes hash(static_cast<size_t>(EVP_MD_get_size(digest)));
   Check(EVP_Digest(toBeSigned.data(), toBeSigned.size(), hash.data(), nullptr, digest, nullptr),
         "digest");
-  Bytes signature = SignDigestWith(issuerKey, digest, hash);
+  Bytes signature = imgtool::SignDigest(issuerKey, digest, hash);
   const char* algorithm = EVP_MD_get_type(digest) == NID_sha1     ? "1.2.840.113549.1.1.5"
                           : EVP_MD_get_type(digest) == NID_sha256 ? "1.2.840.113549.1.1.11"
                                                                   : "1.2.840.113549.1.1.12";
@@ -178,31 +150,13 @@ Bytes ReplaceOnce(const Bytes& bytes, const std::string& fromHex, const std::str
 }
 
 Bytes RsaPublicKeyOf(const std::string& keyPath) {
-  PkeyPtr key = LoadKey(keyPath);
+  PkeyPtr key = LoadPrivateKey(keyPath);
   unsigned char* der = nullptr;
   int length = i2d_PublicKey(key.get(), &der);
   Check(length > 0, "public key");
   Bytes bytes(der, der + length);
   OPENSSL_free(der);
   return bytes;
-}
-
-Bytes SignDigestWith(const std::string& keyPath, const EVP_MD* md, const Bytes& digest) {
-  PkeyPtr key = LoadKey(keyPath);
-  std::unique_ptr<EVP_PKEY_CTX, Deleter<EVP_PKEY_CTX_free>> ctx(EVP_PKEY_CTX_new(key.get(), nullptr));
-  Check(ctx && EVP_PKEY_sign_init(ctx.get()) == 1 &&
-            EVP_PKEY_CTX_set_signature_md(ctx.get(), md) == 1,
-        "sign init");
-  if (EVP_PKEY_get_base_id(key.get()) == EVP_PKEY_RSA) {
-    Check(EVP_PKEY_CTX_set_rsa_padding(ctx.get(), RSA_PKCS1_PADDING) == 1, "padding");
-  }
-  size_t length = 0;
-  Check(EVP_PKEY_sign(ctx.get(), nullptr, &length, digest.data(), digest.size()) == 1, "size");
-  Bytes signature(length);
-  Check(EVP_PKEY_sign(ctx.get(), signature.data(), &length, digest.data(), digest.size()) == 1,
-        "sign");
-  signature.resize(length);
-  return signature;
 }
 
 }  // namespace brisvale::testing

@@ -9,26 +9,15 @@
 #include <string>
 #include <vector>
 
+#include "test_files.h"
+
 namespace brisvale::testing {
 
 using Bytes = std::vector<uint8_t>;
 
 std::string Pki(const std::string& name);  // a file of the development PKI
-Bytes ReadBytes(const std::filesystem::path& path);
-void WriteBytes(const std::filesystem::path& path, const Bytes& bytes);
-
-// A fresh directory, removed with everything in it when the object goes.
-class ScratchDir {
- public:
-  ScratchDir();
-  ~ScratchDir();
-  ScratchDir(const ScratchDir&) = delete;
-  ScratchDir& operator=(const ScratchDir&) = delete;
-  std::filesystem::path operator/(const std::string& name) const { return path_ / name; }
-
- private:
-  std::filesystem::path path_;
-};
+inline Bytes ReadBytes(const std::filesystem::path& path) { return ReadFileBytes(path); }
+inline void WriteBytes(const std::filesystem::path& path, const Bytes& bytes) { WriteFileBytes(path, bytes); }
 
 // Runs brisvale-imgtool with the arguments; true when it exits 0.
 bool RunImgtool(const std::vector<std::string>& args);
@@ -56,8 +45,8 @@ Bytes Resign(const Bytes& toBeSigned, const std::string& issuerKey, const EVP_MD
 Bytes ReplaceOnce(const Bytes& bytes, const std::string& fromHex, const std::string& toHex);
 Bytes FromHex(const std::string& hex);
 
-// PKCS#1 RSAPublicKey of a PEM key, and a PKCS#1 v1.5 signature over `digest` with it.
+// PKCS#1 RSAPublicKey of a PEM key. Signatures come from imgtool::SignDigest, the code
+// the image builders sign with.
 Bytes RsaPublicKeyOf(const std::string& keyPath);
-Bytes SignDigestWith(const std::string& keyPath, const EVP_MD* md, const Bytes& digest);
 
 }  // namespace brisvale::testing

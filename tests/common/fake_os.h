@@ -61,6 +61,7 @@ class FakeOs : public os::Os {
   int ReadFile(const char*, size_t, std::vector<uint8_t>&) override { return -ENOSYS; }
   int OpenFile(const char*) override { return -ENOSYS; }
   int FileSize(int, uint64_t&) override { return -ENOSYS; }
+  int64_t Read(int, std::span<uint8_t>, uint64_t) override { return -ENOSYS; }
   int MapFile(int, size_t, std::unique_ptr<os::FileMapping>&) override { return -ENOSYS; }
   int UnlinkAt(int, const char*) override { return -ENOSYS; }
   int RemoveDirectoryAt(int, const char*) override { return -ENOSYS; }

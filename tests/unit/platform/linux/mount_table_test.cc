@@ -1,3 +1,4 @@
+// The Linux mount-table reader: count then fill, decoded paths, the read-only flag.
 #include <gtest/gtest.h>
 #include <sys/mount.h>
 #include <unistd.h>
@@ -6,6 +7,7 @@
 #include <string>
 
 #include "platform/linux/os_system.h"
+#include "test_files.h"
 
 namespace brisvale::os {
 namespace {
@@ -45,17 +47,16 @@ TEST(MountTable, CountThenFillDecodesPathsAndReadsTheReadOnlyFlag) {
 
 // The fill reuses the count's table only while the kernel reports no change.
 TEST(MountTable, FillSeesAMountMadeAfterTheCount) {
-  if (geteuid() != 0) GTEST_SKIP() << "needs root to mount";
-  char dir[] = "/tmp/brisvale-mount-XXXXXX";
-  ASSERT_NE(mkdtemp(dir), nullptr);
+  BRISVALE_REQUIRE_ROOT();
+  const testing::ScratchDir scratch;
+  const std::string dir = scratch.str();
   LinuxOs os;
   const int counted = os.GetMountTable({});
   ASSERT_GT(counted, 0);
-  ASSERT_EQ(mount("tmpfs", dir, "tmpfs", 0, nullptr), 0);
+  ASSERT_EQ(mount("tmpfs", dir.c_str(), "tmpfs", 0, nullptr), 0);
   std::vector<MountRecord> records(counted + 1);
   const int filled = os.GetMountTable(records);
-  umount2(dir, MNT_DETACH);
-  rmdir(dir);
+  umount2(dir.c_str(), MNT_DETACH);
   ASSERT_EQ(filled, counted + 1);
   EXPECT_EQ(records[filled - 1].mountedOn, dir);
 }

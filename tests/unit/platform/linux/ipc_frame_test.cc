@@ -1,3 +1,4 @@
+// The transport's length-prefixed frames: encoding, incremental decoding and limits.
 #include "platform/linux/ipc_frame.h"
 
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// Kernel device events translated into the hardware event stream's event names.
 #include "platform/linux/ipc_uevent.h"
 
 #include <gtest/gtest.h>

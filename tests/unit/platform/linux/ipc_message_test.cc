@@ -1,3 +1,4 @@
+// Transport keys kept apart from the dictionary a handler sees.
 #include "platform/linux/ipc_message.h"
 
 #include <gtest/gtest.h>

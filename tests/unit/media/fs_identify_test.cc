@@ -1,3 +1,4 @@
+// File-system identification from a volume header (media/fs_identify).
 #include "media/fs_identify.h"
 
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// Hex text to bytes and bytes to upper-case hex text (base/hex).
 #include "base/hex.h"
 
 #include <gtest/gtest.h>

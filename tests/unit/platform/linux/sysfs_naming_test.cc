@@ -1,3 +1,4 @@
+// Names the sysfs provider derives: partition-table content strings and USB location IDs.
 #include <gtest/gtest.h>
 
 #include "platform/linux/registry_sysfs.h"

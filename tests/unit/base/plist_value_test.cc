@@ -1,3 +1,4 @@
+// The property-list value type: kinds, copies, dictionary order and descriptions.
 #include <gtest/gtest.h>
 
 #include <cstdint>

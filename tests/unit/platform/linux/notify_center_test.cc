@@ -8,6 +8,7 @@
 #include <filesystem>
 
 #include "platform/linux/notify_center.h"
+#include "test_files.h"
 
 namespace brisvale::notify {
 namespace {
@@ -15,18 +16,14 @@ namespace {
 namespace fs = std::filesystem;
 
 struct NotifyCenterTest : ::testing::Test {
-  NotifyCenterTest() {
-    char dir[] = "/tmp/brisvale-notify-XXXXXX";
-    directory = ::mkdtemp(dir);
-    center = CreateLinuxSystemNotify(directory + "/notify");
-  }
-  ~NotifyCenterTest() override { fs::remove_all(directory); }
+  NotifyCenterTest() { center = CreateLinuxSystemNotify(directory + "/notify"); }
 
   size_t SocketCount() const {
     return static_cast<size_t>(std::distance(fs::directory_iterator(directory + "/notify"), fs::directory_iterator()));
   }
 
-  std::string directory;
+  const brisvale::testing::ScratchDir scratch;
+  const std::string directory = scratch.str();
   std::unique_ptr<SystemNotify> center;
 };
 

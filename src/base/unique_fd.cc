@@ -1,0 +1,9 @@
+#include "base/unique_fd.h"
+
+#include <unistd.h>
+
+namespace brisvale {
+
+void CloseFd(int fd) { ::close(fd); }
+
+}  // namespace brisvale
