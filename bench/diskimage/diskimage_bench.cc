@@ -27,7 +27,7 @@ constexpr const char* kVersion =
     "<string>21.4.1</string></dict></plist>\n";
 
 struct Setup {
-  testing::SandboxDaemon daemon;
+  brisvale::testing::SandboxDaemon daemon;
   std::string image, signature;
   bool ok = false;
   int staged = 0;
@@ -44,13 +44,13 @@ struct Setup {
     fs::copy_file(pki + "/developer-ca.pem", daemon.Path("/System/Library/Tethra/CorvexCA.pem"));
     fs::create_directories(daemon.Path("/Developer"));
     // Real data, so the digest reads 512 MiB rather than holes.
-    testing::RunProgram({"/bin/sh", "-c", "head -c 480M /dev/urandom > " + work + "/content/payload"});
+    brisvale::testing::RunProgram({"/bin/sh", "-c", "head -c 480M /dev/urandom > " + work + "/content/payload"});
     image = work + "/image.img";
     signature = work + "/image.sig";
-    ok = testing::RunProgram({imgtool, "trust-cache", work + "/content", "-o", work + "/content/.TrustCache"}) == 0 &&
-         testing::RunProgram({"/bin/sh", "-c", "mkfs.ext4 -q -O ^has_journal -d " + work + "/content " + image +
+    ok = brisvale::testing::RunProgram({imgtool, "trust-cache", work + "/content", "-o", work + "/content/.TrustCache"}) == 0 &&
+         brisvale::testing::RunProgram({"/bin/sh", "-c", "mkfs.ext4 -q -O ^has_journal -d " + work + "/content " + image +
                                                    " 512M"}) == 0 &&
-         testing::RunProgram({imgtool, "sign-developer", "--key", pki + "/developer-signing.key", "--image", image,
+         brisvale::testing::RunProgram({imgtool, "sign-developer", "--key", pki + "/developer-signing.key", "--image", image,
                               "-o", signature}) == 0 &&
          daemon.Start();
     if (!ok) std::fprintf(stderr, "bench set-up failed\n");

@@ -98,7 +98,7 @@ void BM_AttachedEventToMountedNotification(benchmark::State& state) {
   RunLoop loop;
   MatchingContext context;
   context.notificationPort = std::move(registry.CreateNotificationPort().value);
-  Daemon daemon(loop, ipc, context, [](int) {});
+  Daemon daemon(loop, context, [](int) {});
 
   auto usb = registry.Publish(nullptr, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}});
   for (int i = 0; i < 32; ++i) {

@@ -24,7 +24,7 @@
 #include "platform/linux/registry_disk_images.h"
 #include "platform/os.h"
 #include "platform/services.h"
-#include "platform/system_devices.h"
+#include "platform/linux/system_devices.h"
 
 namespace brisvale::registry {
 namespace {

@@ -60,11 +60,11 @@ class FileTreeOs : public FakeOs {
   }
   os::TreeWalk WalkTree(const char* root, const std::function<bool(const os::TreeNode&)>& visit) override {
     const std::string prefix = std::string(root) + "/";
-    visit({os::TreeNode::Kind::DirectoryPreorder, root, 0, false});
+    visit({os::TreeNode::Kind::DirectoryPreorder, root, 0, false, {}, -1});
     for (const auto& [path, status] : files) {
-      if (path.starts_with(prefix)) visit({os::TreeNode::Kind::NonDirectory, path, 1, false});
+      if (path.starts_with(prefix)) visit({os::TreeNode::Kind::NonDirectory, path, 1, false, {}, -1});
     }
-    visit({os::TreeNode::Kind::DirectoryPostorder, root, 0, false});
+    visit({os::TreeNode::Kind::DirectoryPostorder, root, 0, false, {}, -1});
     return {};
   }
   // The image reads "image" through a real descriptor.
