@@ -14,6 +14,8 @@
 
 #include "base/unique_fd.h"
 #include "platform/linux/loop_device.h"
+#include "platform/os.h"
+#include "platform/services.h"
 #include "sandbox_daemon.h"
 #include "verify/image_digest.h"
 
@@ -21,6 +23,9 @@ namespace {
 
 using namespace brisvale;
 namespace fs = std::filesystem;
+
+// The digests read through the platform's file calls, as they do in the daemon.
+const brisvale::ScopedServices systemOs(brisvale::Services{.os = &brisvale::os::SystemOs()});
 
 constexpr const char* kVersion =
     "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict><key>ProductVersion</key>"

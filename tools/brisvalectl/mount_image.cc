@@ -18,6 +18,8 @@
 #include "base/hex.h"
 #include "base/unique_fd.h"
 #include "json.h"
+#include "platform/os.h"
+#include "platform/services.h"
 #include "verify/container/qor4.h"
 #include "verify/image_digest.h"
 
@@ -78,6 +80,8 @@ std::optional<plist::Bytes> ImageDigest(const MountImageOptions& options, const 
     }
   }
   std::vector<uint8_t> digest;
+  // The digest code reads through the platform's file calls, as it does in the daemon.
+  const ScopedServices services(Services{.os = &os::SystemOs()});
   if (verify::DigestImageFile(options.imagePath, &digest, length == 48 ? 48 : 20) != 0) return std::nullopt;
   return digest;
 }

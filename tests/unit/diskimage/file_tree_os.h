@@ -76,6 +76,10 @@ class FileTreeOs : public FakeOs {
     std::fclose(file);
     return fd;
   }
+  int64_t Read(int fd, std::span<uint8_t> buffer, uint64_t offset) override {
+    const ssize_t count = ::pread(fd, buffer.data(), buffer.size(), static_cast<off_t>(offset));
+    return count >= 0 ? count : -errno;
+  }
   int TakeReadLease(int) override { return leaseResult; }
   bool HoldsReadLease(int) override { return leaseHeld; }
   int Unlink(const char* path) override {
