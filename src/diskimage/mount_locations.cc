@@ -76,7 +76,8 @@ std::optional<std::string> MakeFreshDirectory(const char* base, bool personalize
 
 }  // namespace
 
-std::optional<std::string> CopyPersonalizedSubType(std::span<const uint8_t> manifest) {
+std::optional<std::span<const uint8_t>> CopyManifestImageProperty(std::span<const uint8_t> manifest,
+                                                                  uint32_t tag) {
   Qor4DecodeContext context{};
   const int decoded = manifest.size() > std::numeric_limits<uint32_t>::max()
                           ? static_cast<int>(DERResultOverflow)
@@ -88,14 +89,19 @@ std::optional<std::string> CopyPersonalizedSubType(std::span<const uint8_t> mani
   }
   const uint8_t* data = nullptr;
   uint32_t length = 0;
-  const int read = Qor4DecodeGetObjectPropertyData(&context, Qor4Code("pdmg"), 0, Qor4Code("pdnm"),
-                                                   0, &data, &length);
+  const int read = Qor4DecodeGetObjectPropertyData(&context, Qor4Code("pdmg"), 0, tag, 0, &data, &length);
   if (read != 0) {
     Log(Level::Default, "Failed to retrieve data from manifest: %d", read);
     return std::nullopt;
   }
+  return std::span<const uint8_t>(data, length);
+}
+
+std::optional<std::string> CopyPersonalizedSubType(std::span<const uint8_t> manifest) {
+  const std::optional<std::span<const uint8_t>> name = CopyManifestImageProperty(manifest, Qor4Code("pdnm"));
+  if (!name) return std::nullopt;
   // Compared and logged as C text: anything after an embedded NUL does not count.
-  std::string subType(reinterpret_cast<const char*>(data), length);
+  std::string subType(reinterpret_cast<const char*>(name->data()), name->size());
   subType.resize(std::char_traits<char>::length(subType.c_str()));
   return subType;
 }

@@ -26,6 +26,11 @@ struct MountLocation {
 std::optional<MountLocation> ResolveMountLocation(std::string_view diskImageType,
                                                   std::span<const uint8_t> imageSignature);
 
+// Property `tag` of the "pdmg" object of a personalized manifest, pointing into
+// `manifest`; none after logging why.
+std::optional<std::span<const uint8_t>> CopyManifestImageProperty(std::span<const uint8_t> manifest,
+                                                                  uint32_t tag);
+
 // The sub-type ("pdnm" of the "pdmg" object) of a personalized manifest, or none after
 // logging why.
 std::optional<std::string> CopyPersonalizedSubType(std::span<const uint8_t> manifest);

@@ -81,33 +81,13 @@ std::optional<plist::Bytes> VerifyImage(const VerifiedMountRequest& request, con
                                         const MountSteps& steps, std::string& subType) {
   std::vector<uint8_t> digest;
   if (request.diskImageType == "Personalized") {
-    Qor4DecodeContext context{};
-    const auto& manifest = request.imageSignature;
-    const int decoded = manifest.size() > std::numeric_limits<uint32_t>::max()
-                            ? static_cast<int>(DERResultOverflow)
-                            : Qor4DecodeInitManifest(manifest.data(),
-                                                     static_cast<uint32_t>(manifest.size()), &context);
-    if (decoded != 0) {
-      Log(Level::Default, "Failed to decode qor4 manifest: %d", decoded);
-      return std::nullopt;
-    }
-    const uint8_t* data = nullptr;
-    uint32_t digestLength = 0;
-    int read = Qor4DecodeGetObjectPropertyData(&context, Qor4Code("pdmg"), 0, Qor4Code("DGST"), 0,
-                                               &data, &digestLength);
-    if (read == 0) {
-      uint32_t nameLength = 0;
-      read = Qor4DecodeGetObjectPropertyData(&context, Qor4Code("pdmg"), 0, Qor4Code("pdnm"), 0,
-                                             &data, &nameLength);
-      if (read == 0) {
-        subType.assign(reinterpret_cast<const char*>(data), nameLength);
-        subType.resize(std::char_traits<char>::length(subType.c_str()));
-      }
-    }
-    if (read != 0) {
-      Log(Level::Default, "Failed to retrieve data from manifest: %d", read);
-      return std::nullopt;
-    }
+    const std::optional<std::span<const uint8_t>> vouched =
+        CopyManifestImageProperty(request.imageSignature, Qor4Code("DGST"));
+    if (!vouched) return std::nullopt;
+    std::optional<std::string> name = CopyPersonalizedSubType(request.imageSignature);
+    if (!name) return std::nullopt;
+    subType = std::move(*name);
+    const long digestLength = static_cast<long>(vouched->size());
     if (verify::DigestImageDescriptor(file.fd, request.imagePath, &digest, digestLength) != 0) {
       Log(Level::Default, "Failed to digest %@.", request.imagePath);
       return std::nullopt;

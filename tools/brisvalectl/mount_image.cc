@@ -126,6 +126,21 @@ std::string StagedPath(const std::string& root, const plist::Bytes& digest, cons
 
 }  // namespace
 
+int PrintMountReply(const plist::Value& reply, bool json) {
+  const std::string* status = reply.getString("Status");
+  const bool ok = status && *status == "Success";
+  if (json) {
+    std::printf("%s\n", ToJson(reply).c_str());
+  } else if (ok) {
+    // A FAT or exFAT medium is listed but not mounted: its "mount path" is the node.
+    const std::string* mountPath = reply.getString("MountPath");
+    std::printf("%s\n", mountPath ? mountPath->c_str() : "");
+  } else {
+    std::fprintf(stderr, "brisvalectl: the daemon answered Failure (its log says why)\n");
+  }
+  return ok ? kOk : kRequestFailed;
+}
+
 int MountImage(const std::vector<std::string>& arguments, const std::string& root, bool json,
                const RequestSender& send) {
   const std::optional<MountImageOptions> options = Parse(arguments);
@@ -183,18 +198,7 @@ int MountImage(const std::vector<std::string>& arguments, const std::string& roo
     rmdir((root + head).c_str());
   }
   if (const int* status = std::get_if<int>(&result)) return *status;
-  const plist::Value& reply = std::get<plist::Value>(result);
-  const std::string* status = reply.getString("Status");
-  const bool ok = status && *status == "Success";
-  if (json) {
-    std::printf("%s\n", ToJson(reply).c_str());
-  } else if (ok) {
-    const std::string* mountPath = reply.getString("MountPath");
-    std::printf("%s\n", mountPath ? mountPath->c_str() : "");
-  } else {
-    std::fprintf(stderr, "brisvalectl: the daemon answered Failure (its log says why)\n");
-  }
-  return ok ? kOk : kRequestFailed;
+  return PrintMountReply(std::get<plist::Value>(result), json);
 }
 
 }  // namespace brisvale::tools

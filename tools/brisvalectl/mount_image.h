@@ -15,6 +15,10 @@ namespace brisvale::tools {
 // Sends one request; answers the decoded reply or an exit status.
 using RequestSender = std::function<std::variant<plist::Value, int>(const plist::Value& request)>;
 
+// Prints a "Mount" reply: its mount path (or the whole reply with `json`), or the
+// failure on stderr. 0 for "Success", 1 otherwise.
+int PrintMountReply(const plist::Value& reply, bool json);
+
 // `arguments` follow "mount-image": --type T, --signature FILE, --consume, IMAGE.
 int MountImage(const std::vector<std::string>& arguments, const std::string& root, bool json,
                const RequestSender& send);

@@ -2,7 +2,6 @@
 
 #include <cstdio>
 
-#include "json.h"
 
 namespace brisvale::tools {
 
@@ -28,19 +27,7 @@ int MountStorage(const std::vector<std::string>& arguments, bool json, const Req
 
   auto result = send(plist::Value(std::move(request)));
   if (const int* status = std::get_if<int>(&result)) return *status;
-  const plist::Value& reply = std::get<plist::Value>(result);
-  const std::string* status = reply.getString("Status");
-  const bool ok = status && *status == "Success";
-  if (json) {
-    std::printf("%s\n", ToJson(reply).c_str());
-  } else if (ok) {
-    // A FAT or exFAT medium is listed but not mounted: its "mount path" is the node.
-    const std::string* mountPath = reply.getString("MountPath");
-    std::printf("%s\n", mountPath ? mountPath->c_str() : "");
-  } else {
-    std::fprintf(stderr, "brisvalectl: the daemon answered Failure (its log says why)\n");
-  }
-  return ok ? 0 : 1;
+  return PrintMountReply(std::get<plist::Value>(result), json);
 }
 
 }  // namespace brisvale::tools
