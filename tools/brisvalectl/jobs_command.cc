@@ -2,7 +2,7 @@
 
 #include <algorithm>
 #include <cstdio>
-#include <vector>
+#include <string_view>
 
 #include "json.h"
 #include "platform/linux/jobs_spool.h"
@@ -18,12 +18,6 @@ std::string ProgramOf(const plist::Dictionary& job) {
   return value && value->string() ? *value->string() : "-";
 }
 
-// The image a job came from, when the job says.
-std::string ImageOf(const plist::Dictionary& job) {
-  const plist::Value* image = job.find("DiskImagePath");
-  return image && image->string() ? *image->string() : "-";
-}
-
 }  // namespace
 
 int ListJobs(const std::string& root, bool json) {
@@ -37,22 +31,17 @@ int ListJobs(const std::string& root, bool json) {
     plist::Array list;
     for (const auto& [label, job] : *jobs) {
       plist::Dictionary row{{"label", plist::Value(label)}, {"program", plist::Value(ProgramOf(job))}};
-      if (const plist::Value* image = job.find("DiskImagePath")) row.set("image", *image);
       row.set("job", plist::Value(job));
       list.push_back(plist::Value(std::move(row)));
     }
     std::printf("%s\n", ToJson(plist::Value(std::move(list))).c_str());
     return 0;
   }
-  std::vector<std::vector<std::string>> rows{{"LABEL", "PROGRAM", "IMAGE"}};
-  for (const auto& [label, job] : *jobs) rows.push_back({label, ProgramOf(job), ImageOf(job)});
-  std::vector<size_t> widths(3, 0);
-  for (const auto& row : rows) {
-    for (size_t i = 0; i < row.size(); ++i) widths[i] = std::max(widths[i], row[i].size());
-  }
-  for (const auto& row : rows) {
-    std::printf("%-*s  %-*s  %s\n", static_cast<int>(widths[0]), row[0].c_str(),
-                static_cast<int>(widths[1]), row[1].c_str(), row[2].c_str());
+  size_t labelWidth = std::string_view("LABEL").size();
+  for (const auto& [label, job] : *jobs) labelWidth = std::max(labelWidth, label.size());
+  std::printf("%-*s  %s\n", static_cast<int>(labelWidth), "LABEL", "PROGRAM");
+  for (const auto& [label, job] : *jobs) {
+    std::printf("%-*s  %s\n", static_cast<int>(labelWidth), label.c_str(), ProgramOf(job).c_str());
   }
   return 0;
 }
