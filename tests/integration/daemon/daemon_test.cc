@@ -126,6 +126,18 @@ TEST_F(DaemonTest, HardwareEventsAreLoggedByName) {
       "debug: Unsupported Kestrix Event: com.vantrel.brisvale_mounter.detached"));
 }
 
+#if defined(__SANITIZE_ADDRESS__)
+constexpr bool kSanitized = true;
+#elif defined(__has_feature)
+#if __has_feature(address_sanitizer)
+constexpr bool kSanitized = true;
+#else
+constexpr bool kSanitized = false;
+#endif
+#else
+constexpr bool kSanitized = false;
+#endif
+
 // What the daemon holds: open descriptors and anonymous memory (KiB).
 std::pair<size_t, long> Holdings(pid_t pid) {
   const std::string proc = "/proc/" + std::to_string(pid);
@@ -241,8 +253,12 @@ TEST_F(DaemonTest, ParkedHalfFramesStayWithinTheBudget) {
   EXPECT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}).ok());
   usleep(200000);
   const auto after = Holdings(daemon.pid());
-  EXPECT_LT(during.second, before.second + 40 * 1024);  // the 32 MiB budget and what is being read
-  EXPECT_LE(after.second, before.second + 1024);
+  // AddressSanitizer keeps freed memory in quarantine, so the daemon's own footprint
+  // only shows in an uninstrumented build.
+  if (!kSanitized) {
+    EXPECT_LT(during.second, before.second + 40 * 1024);  // the 32 MiB budget and what is being read
+    EXPECT_LE(after.second, before.second + 1024);
+  }
   bool cancelled = false;
   for (const std::string& line : daemon.LogLines()) cancelled |= line.find("over the budget") != std::string::npos;
   EXPECT_TRUE(cancelled);
