@@ -14,11 +14,6 @@
 namespace brisvale {
 namespace {
 
-using log::Level;
-using log::Log;
-
-constexpr size_t kPathBufferSize = 1024;
-
 // Every path something is mounted on. The inventory knows only the mounts of devices
 // it tracks; this keeps a bind mount or a memory file system placed in a root from
 // being emptied too. Empty when the table cannot be read.
@@ -47,7 +42,7 @@ bool IsMounted(const std::string& path, const std::vector<std::string>& mountedP
 
 int RemoveTree(const char* path, int removeStart) {
   os::Os& os = *CurrentServices().os;
-  const std::string start = std::string(path).substr(0, kPathBufferSize);
+  const std::string start = std::string(path).substr(0, os::kPathBufferSize);
   int result = 0;
   // Every removal names the node relative to the directory the walk holds open, so a
   // directory swapped for a link meanwhile loses the link, never what it points to.
@@ -101,7 +96,7 @@ void RemoveStaleMountPoints(const char* mountRoot) {
   std::string resolvedRoot;
   if (!entries.empty() && os.RealPath(mountRoot, resolvedRoot) < 0) resolvedRoot = mountRoot;
   for (const os::DirectoryEntry& entry : entries) {
-    const std::string joined = (std::string(mountRoot) + "/" + entry.name).substr(0, kPathBufferSize - 1);
+    const std::string joined = (std::string(mountRoot) + "/" + entry.name).substr(0, os::kPathBufferSize - 1);
     // A link is removed itself, never resolved: resolving it would aim the removal at
     // whatever it points to, possibly outside the root. Everything else is resolved,
     // because the mount table lists resolved paths ("/var/mnt" is "/private/var/mnt").

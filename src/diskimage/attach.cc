@@ -16,9 +16,6 @@
 namespace brisvale {
 namespace {
 
-using log::Level;
-using log::Log;
-
 constexpr std::string_view kControllerClass = "KxNimbrelController";
 constexpr std::string_view kUniqueIdentifierKey = "nimbrel-unique-identifier";
 constexpr uint32_t kAttachMagic = 0xBEEFFEED;

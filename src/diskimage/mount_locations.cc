@@ -13,9 +13,6 @@
 namespace brisvale {
 namespace {
 
-using log::Level;
-using log::Log;
-
 constexpr uint32_t kDirectoryMode = 0755;
 constexpr const char* kDeveloperCertificate = "/System/Library/Tethra/CorvexDebug.pem";
 constexpr const char* kFactoryRoot = "/private/var/factory_mount";

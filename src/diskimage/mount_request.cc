@@ -15,9 +15,6 @@
 namespace brisvale {
 namespace {
 
-using log::Level;
-using log::Log;
-
 constexpr const char* kDiskImageMountedNotification = "com.vantrel.mobile.disk_image_mounted";
 constexpr const char* kNotificationObject = "BrisvaleMounter";
 

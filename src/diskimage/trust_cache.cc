@@ -14,7 +14,6 @@
 namespace brisvale {
 namespace {
 
-constexpr size_t kPathBufferSize = 1024;
 constexpr uint32_t kUserClientType = 0;
 constexpr uint32_t kLoadTrustCacheSelector = 2;
 constexpr registry::Status kLowBits = 0x3FFF;
@@ -23,7 +22,7 @@ constexpr registry::Status kLowBits = 0x3FFF;
 
 int LoadTrustCache(std::string_view mountPath) {
   const std::string path = std::string(mountPath) + "/.TrustCache";
-  if (mountPath.size() >= kPathBufferSize || path.size() >= kPathBufferSize) {
+  if (mountPath.size() >= os::kPathBufferSize || path.size() >= os::kPathBufferSize) {
     Log(Level::Default, "Failed to create string.");
     return -1;
   }

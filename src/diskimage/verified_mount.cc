@@ -20,9 +20,6 @@
 namespace brisvale {
 namespace {
 
-using log::Level;
-using log::Log;
-
 constexpr long kSha1Length = 20;
 // Mount points under this prefix are fixed directories of the system image.
 constexpr std::string_view kKeptMountPointPrefix = "/Developer";

@@ -13,10 +13,6 @@
 namespace brisvale {
 namespace {
 
-// Texts handed to the platform's calls are bounded like their fixed-size buffers,
-// terminator included.
-constexpr size_t kPathBufferSize = 1024;
-
 // The HFS master directory block is read at byte 1024 of the device.
 constexpr size_t kMasterDirectoryBlockOffset = 1024;
 constexpr size_t kMasterDirectoryBlockSize = 512;
@@ -62,7 +58,7 @@ std::optional<std::string> ReadUserTextEncoding() {
   std::string home;
   if (os.UserHomeDirectory(0, home) < 0) return std::nullopt;
   std::vector<uint8_t> contents;
-  if (os.ReadFile((home + "/.ZxUserTextEncoding").c_str(), kPathBufferSize - 1, contents) < 0) {
+  if (os.ReadFile((home + "/.ZxUserTextEncoding").c_str(), os::kPathBufferSize - 1, contents) < 0) {
     return std::nullopt;
   }
   return std::string(contents.begin(), contents.end());
@@ -76,8 +72,8 @@ std::optional<std::string> MountImageVolume(std::string_view bsdName, std::strin
     return std::nullopt;
   }
   const std::string devicePath = "/dev/" + std::string(bsdName);
-  if (bsdName.size() >= kPathBufferSize || devicePath.size() >= kPathBufferSize ||
-      mountPath.size() >= kPathBufferSize) {
+  if (bsdName.size() >= os::kPathBufferSize || devicePath.size() >= os::kPathBufferSize ||
+      mountPath.size() >= os::kPathBufferSize) {
     Log(Level::Default, "Failed to create string.");
     return std::nullopt;
   }

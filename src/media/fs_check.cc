@@ -7,9 +7,6 @@
 namespace brisvale {
 namespace {
 
-using log::Level;
-using log::Log;
-
 constexpr const char* kChecker = "/sbin/fsck_hfs";
 
 bool IsHfs(FsType type) { return type == FsTypeHFSPlus || type == FsTypeHFSX; }

@@ -11,9 +11,6 @@
 namespace brisvale {
 namespace {
 
-using log::Level;
-using log::Log;
-
 constexpr const char* kMountRoot = "/var/mnt";
 constexpr int kMountPointCount = 4;
 constexpr uint32_t kMountPointMode = 0777;

@@ -16,11 +16,7 @@
 namespace brisvale {
 namespace {
 
-using log::Level;
-using log::Log;
-
 constexpr const char* kMountedNotification = "com.vantrel.brisvale_mounted";
-constexpr size_t kPathBufferSize = 1024;
 // The type name every recorded-but-unmounted FAT or exFAT medium carries.
 constexpr const char* kUnmountedTypeName = "exfat";
 static_assert(sizeof("exfat") <= 16, "the type name must fit its 16-byte field");
@@ -71,7 +67,7 @@ std::optional<std::string> AnnounceMount(std::string_view deviceNode, const os::
 
 std::optional<std::string> MountMassStorageDevice(std::string_view deviceNode, bool readOnly,
                                                   bool& verificationFailed, bool& mountFailed) {
-  if (deviceNode.size() >= kPathBufferSize || !utf8::IsValid(deviceNode) ||
+  if (deviceNode.size() >= os::kPathBufferSize || !utf8::IsValid(deviceNode) ||
       deviceNode.find('\0') != std::string_view::npos) {
     Log(Level::Default, "Failed to create string.");
     return std::nullopt;
