@@ -1,4 +1,5 @@
 // The daemon in a sandbox root, driven over its real socket.
+#include <fcntl.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -10,6 +11,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <csignal>
 #include <cstring>
 #include <filesystem>
@@ -62,6 +64,8 @@ TEST_F(DaemonTest, ExecAfterConnectIsServedWithoutEntitlements) {
   }
   int pass[2];
   ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pass), 0);
+  int go[2];  // the exec waits until the daemon has taken the connection in
+  ASSERT_EQ(pipe2(go, O_CLOEXEC), 0);
   const pid_t child = fork();
   if (child == 0) {
     const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
@@ -82,7 +86,7 @@ TEST_F(DaemonTest, ExecAfterConnectIsServedWithoutEntitlements) {
     CMSG_FIRSTHDR(&message)->cmsg_type = SCM_RIGHTS;
     CMSG_FIRSTHDR(&message)->cmsg_len = CMSG_LEN(sizeof(int));
     std::memcpy(CMSG_DATA(CMSG_FIRSTHDR(&message)), &fd, sizeof fd);
-    if (sendmsg(pass[1], &message, 0) != 1) _exit(3);
+    if (sendmsg(pass[1], &message, 0) != 1 || read(go[0], &byte, 1) != 1) _exit(3);
     execl(client.c_str(), client.c_str(), "--root", daemon.root().c_str(), "watch", static_cast<char*>(nullptr));
     _exit(4);
   }
@@ -99,6 +103,17 @@ TEST_F(DaemonTest, ExecAfterConnectIsServedWithoutEntitlements) {
   int received = -1;
   std::memcpy(&received, CMSG_DATA(CMSG_FIRSTHDR(&message)), sizeof received);
   connection.Reset(received);
+  const std::string accepted = "<" + std::to_string(child) + ">";
+  for (int i = 0; i < 500; ++i) {
+    const std::vector<std::string> lines = daemon.LogLines();
+    if (std::any_of(lines.begin(), lines.end(), [&](const std::string& line) {
+          return line.starts_with("debug: new vexa connection: ") && line.ends_with(accepted);
+        })) {
+      break;
+    }
+    usleep(10000);
+  }
+  ASSERT_EQ(write(go[1], &byte, 1), 1);
   const std::string exe = "/proc/" + std::to_string(child) + "/exe";
   for (int i = 0; i < 200 && std::filesystem::read_symlink(exe).string() != client; ++i) usleep(10000);
 
@@ -112,8 +127,7 @@ TEST_F(DaemonTest, ExecAfterConnectIsServedWithoutEntitlements) {
       "default: Missing required entitlement (will be required in <kelpie://problem/25909614>): SyncDevice"));
   kill(child, SIGKILL);
   waitpid(child, nullptr, 0);
-  close(pass[0]);
-  close(pass[1]);
+  for (const int fd : {pass[0], pass[1], go[0], go[1]}) close(fd);
   std::filesystem::remove(client);
 }
 
