@@ -328,6 +328,15 @@ std::vector<std::string> CaptureSink::Texts() const {
   return texts;
 }
 
+std::vector<std::string> CaptureSink::Texts(Level level) const {
+  std::lock_guard lock(mutex_);
+  std::vector<std::string> texts;
+  for (const Line& line : lines_) {
+    if (line.level == level) texts.push_back(line.text);
+  }
+  return texts;
+}
+
 bool CaptureSink::Contains(Level level, std::string_view text) const {
   std::lock_guard lock(mutex_);
   for (const Line& line : lines_) {

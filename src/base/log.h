@@ -64,6 +64,7 @@ class CaptureSink : public Sink {
   void Write(Level level, std::string_view text) override;
   std::vector<Line> Lines() const;
   std::vector<std::string> Texts() const;  // the texts alone, in order
+  std::vector<std::string> Texts(Level level) const;  // those logged at `level`
   bool Contains(Level level, std::string_view text) const;
   void Clear();
 

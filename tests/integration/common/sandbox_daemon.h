@@ -63,4 +63,13 @@ class SandboxDaemon {
 // what it printed on stdout.
 int RunProgram(const std::vector<std::string>& argv, std::string* output = nullptr);
 
+// One object of a `--devices` file: its class, properties and children.
+inline plist::Value DeviceObject(std::string name, std::string className, plist::Dictionary properties,
+                                 plist::Array children = {}) {
+  return plist::Dictionary{{"Name", plist::Value(std::move(name))},
+                           {"Class", plist::Value(std::move(className))},
+                           {"Properties", plist::Value(std::move(properties))},
+                           {"Children", plist::Value(std::move(children))}};
+}
+
 }  // namespace brisvale::testing

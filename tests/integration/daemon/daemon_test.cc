@@ -51,6 +51,28 @@ TEST_F(DaemonTest, BadRequestsCancelTheConnectionWithoutReply) {
   EXPECT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "Sync"}}).ok());
 }
 
+// Sends `fd` over the socket pair `socket`, or receives one into `fd`.
+bool PassDescriptor(int socket, int& fd, bool receive = false) {
+  char control[CMSG_SPACE(sizeof(int))] = {};
+  char byte = 0;
+  iovec data{&byte, 1};
+  msghdr message{};
+  message.msg_iov = &data;
+  message.msg_iovlen = 1;
+  message.msg_control = control;
+  message.msg_controllen = sizeof control;
+  if (receive) {
+    if (recvmsg(socket, &message, 0) != 1 || !CMSG_FIRSTHDR(&message)) return false;
+    std::memcpy(&fd, CMSG_DATA(CMSG_FIRSTHDR(&message)), sizeof fd);
+    return true;
+  }
+  CMSG_FIRSTHDR(&message)->cmsg_level = SOL_SOCKET;
+  CMSG_FIRSTHDR(&message)->cmsg_type = SCM_RIGHTS;
+  CMSG_FIRSTHDR(&message)->cmsg_len = CMSG_LEN(sizeof(int));
+  std::memcpy(CMSG_DATA(CMSG_FIRSTHDR(&message)), &fd, sizeof fd);
+  return sendmsg(socket, &message, 0) == 1;
+}
+
 // A process that connects without the entitlement and then execs a program that has it
 // is served without: the daemon goes by the program that connected.
 TEST_F(DaemonTest, ExecAfterConnectIsServedWithoutEntitlements) {
@@ -68,41 +90,21 @@ TEST_F(DaemonTest, ExecAfterConnectIsServedWithoutEntitlements) {
   ASSERT_EQ(pipe2(go, O_CLOEXEC), 0);
   const pid_t child = fork();
   if (child == 0) {
-    const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     std::snprintf(address.sun_path, sizeof address.sun_path, "%s", daemon.ServiceSocket().c_str());
     if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) _exit(2);
     // Hands the connection to the test, then becomes the entitled program.
-    char control[CMSG_SPACE(sizeof(int))] = {};
     char byte = 0;
-    iovec data{&byte, 1};
-    msghdr message{};
-    message.msg_iov = &data;
-    message.msg_iovlen = 1;
-    message.msg_control = control;
-    message.msg_controllen = sizeof control;
-    CMSG_FIRSTHDR(&message)->cmsg_level = SOL_SOCKET;
-    CMSG_FIRSTHDR(&message)->cmsg_type = SCM_RIGHTS;
-    CMSG_FIRSTHDR(&message)->cmsg_len = CMSG_LEN(sizeof(int));
-    std::memcpy(CMSG_DATA(CMSG_FIRSTHDR(&message)), &fd, sizeof fd);
-    if (sendmsg(pass[1], &message, 0) != 1 || read(go[0], &byte, 1) != 1) _exit(3);
+    if (!PassDescriptor(pass[1], fd) || read(go[0], &byte, 1) != 1) _exit(3);
     execl(client.c_str(), client.c_str(), "--root", daemon.root().c_str(), "watch", static_cast<char*>(nullptr));
     _exit(4);
   }
-  char control[CMSG_SPACE(sizeof(int))] = {};
-  char byte = 0;
-  iovec data{&byte, 1};
-  msghdr message{};
-  message.msg_iov = &data;
-  message.msg_iovlen = 1;
-  message.msg_control = control;
-  message.msg_controllen = sizeof control;
-  ASSERT_EQ(recvmsg(pass[0], &message, 0), 1);
-  UniqueFd connection;
   int received = -1;
-  std::memcpy(&received, CMSG_DATA(CMSG_FIRSTHDR(&message)), sizeof received);
-  connection.Reset(received);
+  ASSERT_TRUE(PassDescriptor(pass[0], received, /*receive=*/true));
+  UniqueFd connection(received);
+  char byte = 0;
   const std::string accepted = "<" + std::to_string(child) + ">";
   for (int i = 0; i < 500; ++i) {
     const std::vector<std::string> lines = daemon.LogLines();

@@ -14,17 +14,9 @@ namespace {
 
 namespace fs = std::filesystem;
 
-plist::Value Object(std::string name, std::string className, plist::Dictionary properties,
-                    plist::Array children = {}) {
-  return plist::Dictionary{{"Name", plist::Value(std::move(name))},
-                           {"Class", plist::Value(std::move(className))},
-                           {"Properties", plist::Value(std::move(properties))},
-                           {"Children", plist::Value(std::move(children))}};
-}
-
 plist::Value Stick(const std::string& bsdName) {
-  return Object("stick-" + bsdName, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}},
-                {Object("media", "KxMedia",
+  return DeviceObject("stick-" + bsdName, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}},
+                {DeviceObject("media", "KxMedia",
                         {{"BSD Name", plist::Value(bsdName)},
                          {"Content", "0x0C"},
                          {"Removable", plist::Value::Bool(false)},
@@ -33,8 +25,8 @@ plist::Value Stick(const std::string& bsdName) {
 }
 
 plist::Value Camera() {
-  return Object("camera", "KxUSBHostDevice", {},
-                {Object("ptp", "KxUSBHostInterface",
+  return DeviceObject("camera", "KxUSBHostDevice", {},
+                {DeviceObject("ptp", "KxUSBHostInterface",
                         {{"bInterfaceClass", plist::Value::Int(6)},
                          {"bInterfaceSubClass", plist::Value::Int(1)},
                          {"bInterfaceProtocol", plist::Value::Int(1)},

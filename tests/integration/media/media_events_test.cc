@@ -21,16 +21,8 @@ namespace {
 
 using namespace std::chrono_literals;
 
-plist::Value Object(std::string name, std::string className, plist::Dictionary properties,
-                    plist::Array children = {}) {
-  return plist::Dictionary{{"Name", plist::Value(std::move(name))},
-                           {"Class", plist::Value(std::move(className))},
-                           {"Properties", plist::Value(std::move(properties))},
-                           {"Children", plist::Value(std::move(children))}};
-}
-
 plist::Value Medium(const std::string& bsdName, bool removable, bool leaf, const std::string& content) {
-  return Object(bsdName, "KxMedia",
+  return DeviceObject(bsdName, "KxMedia",
                 {{"BSD Name", plist::Value(bsdName)}, {"Content", plist::Value(content)},
                  {"Removable", plist::Value::Bool(removable)}, {"Leaf", plist::Value::Bool(leaf)},
                  {"Writable", plist::Value::Bool(true)}});
@@ -38,7 +30,7 @@ plist::Value Medium(const std::string& bsdName, bool removable, bool leaf, const
 
 // A USB device holding one medium that is a whole volume.
 plist::Value Stick(const std::string& bsdName) {
-  return Object("usb-" + bsdName, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}},
+  return DeviceObject("usb-" + bsdName, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}},
                 {Medium(bsdName, true, true, "")});
 }
 
@@ -49,13 +41,13 @@ plist::Value PartitionedStick(const std::string& disk) {
   plist::Dictionary withChildren = *wholeDisk.dictionary();
   withChildren.set("Children", plist::Array{Medium(disk + "1", false, true, "C12A7328-F81F-11D2-BA4B-00A0C93EC93B"),
                                             Medium(disk + "2", false, true, "48465300-0000-11AA-AA11-00306543ECAC")});
-  return Object("usb-" + disk, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}},
+  return DeviceObject("usb-" + disk, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}},
                 {plist::Value(std::move(withChildren))});
 }
 
 plist::Value Camera(const std::string& name, int64_t location) {
-  return Object(name, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}},
-                {Object("ptp", "KxUSBHostInterface",
+  return DeviceObject(name, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}},
+                {DeviceObject("ptp", "KxUSBHostInterface",
                         {{"bInterfaceClass", plist::Value::Int(6)}, {"bInterfaceSubClass", plist::Value::Int(1)},
                          {"bInterfaceProtocol", plist::Value::Int(1)}, {"locationID", plist::Value::Int(location)}})});
 }

@@ -45,14 +45,6 @@ plist::Value AllSPIs() {
   return plist::Array{"CopyDevices", "MountDevice", "UnmountDevice", "SyncDevice"};
 }
 
-std::vector<std::string> DefaultLines(const log::CaptureSink& capture) {
-  std::vector<std::string> texts;
-  for (const log::Line& line : capture.Lines()) {
-    if (line.level == Level::Default) texts.push_back(line.text);
-  }
-  return texts;
-}
-
 struct Rejection {
   const char* name;
   ipc::Message message;
@@ -89,7 +81,7 @@ TEST(HandleRequest, MalformedRequestsAreRejectedWithTheirLine) {
     MatchingContext context;
     EXPECT_FALSE(HandleRequest(context, &connection, c.message));
     EXPECT_THAT(connection.sent, IsEmpty());
-    EXPECT_THAT(DefaultLines(capture), ElementsAre(c.line));
+    EXPECT_THAT(capture.Texts(Level::Default), ElementsAre(c.line));
   }
 }
 
@@ -154,7 +146,7 @@ TEST(HandleRequest, MissingEntitlementIsLoggedAndRequestStillServed) {
     EXPECT_TRUE(HandleRequest(context, &connection,
                               Request(plist::Dictionary{{"RequestType", "CopyDevices"}})));
     EXPECT_EQ(connection.sent.size(), 1u);
-    EXPECT_EQ(DefaultLines(capture), c.lines);
+    EXPECT_EQ(capture.Texts(Level::Default), c.lines);
   }
 }
 

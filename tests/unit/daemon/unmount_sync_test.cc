@@ -80,14 +80,6 @@ class UnmountSyncTest : public ::testing::Test {
     return *reply.find("Status")->string();
   }
 
-  std::vector<std::string> DefaultLines() const {
-    std::vector<std::string> lines;
-    for (const log::Line& line : capture.Lines()) {
-      if (line.level == log::Level::Default) lines.push_back(line.text);
-    }
-    return lines;
-  }
-
   RecordingOs os;
   RecordingNotify center;
   log::CaptureSink capture;
@@ -149,7 +141,7 @@ TEST_F(UnmountSyncTest, UnmountFailuresLogTheirLineAndLeaveTheRest) {
     center.posted.clear();
     capture.Clear();
     EXPECT_EQ(Run(HandleUnmount, c.request), c.status);
-    EXPECT_EQ(DefaultLines(), c.lines);
+    EXPECT_EQ(capture.Texts(log::Level::Default), c.lines);
     EXPECT_EQ(os.calls.size(), c.calls);
     EXPECT_EQ(center.posted.size(), c.posted);
   }
@@ -158,7 +150,7 @@ TEST_F(UnmountSyncTest, UnmountFailuresLogTheirLineAndLeaveTheRest) {
 TEST_F(UnmountSyncTest, SyncHasItsOwnLines) {
   EXPECT_EQ(Run(HandleSync, {{"MountPath", "/Developer"}}), "Success");
   EXPECT_THAT(os.calls, ElementsAre("sync /Developer"));
-  EXPECT_THAT(DefaultLines(), IsEmpty());
+  EXPECT_THAT(capture.Texts(log::Level::Default), IsEmpty());
 
   const std::pair<plist::Dictionary, std::string> failures[] = {
       {{}, "Failed to extract MountPath from request"},
@@ -167,12 +159,12 @@ TEST_F(UnmountSyncTest, SyncHasItsOwnLines) {
   for (const auto& [request, line] : failures) {
     capture.Clear();
     EXPECT_EQ(Run(HandleSync, request), "Failure");
-    EXPECT_THAT(DefaultLines(), ElementsAre(line));
+    EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre(line));
   }
   os.syncResult = -EIO;
   capture.Clear();
   EXPECT_EQ(Run(HandleSync, {{"MountPath", "/private/var/mnt/media1"}}), "Failure");
-  EXPECT_THAT(DefaultLines(), ElementsAre("Failed to force the sync /private/var/mnt/media1: 5"));
+  EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre("Failed to force the sync /private/var/mnt/media1: 5"));
 }
 
 }  // namespace

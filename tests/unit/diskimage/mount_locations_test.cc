@@ -24,13 +24,6 @@ derwriter::Bytes ManifestOfSubType(std::string_view subType) {
 }
 
 struct MountLocationsTest : ::testing::Test {
-  std::vector<std::string> DefaultLines() const {
-    std::vector<std::string> lines;
-    for (const log::Line& line : capture.Lines()) {
-      if (line.level == log::Level::Default) lines.push_back(line.text);
-    }
-    return lines;
-  }
   testing::FileTreeOs os;
   log::CaptureSink capture;
   ScopedServices services{Services{nullptr, &os, nullptr, nullptr}};
@@ -67,7 +60,7 @@ TEST_F(MountLocationsTest, TypeAndSubTypeDecideDirectoryAndNotification) {
     const std::optional<MountLocation> location = ResolveMountLocation(c.type, manifest);
     if (c.mountPath.empty()) {
       EXPECT_FALSE(location);
-      EXPECT_EQ(DefaultLines(), std::vector{c.notificationOrLine});
+      EXPECT_EQ(capture.Texts(log::Level::Default), std::vector{c.notificationOrLine});
       continue;
     }
     ASSERT_TRUE(location);
@@ -103,7 +96,7 @@ TEST_F(MountLocationsTest, MountPointMustBeAnEmptyDirectoryOrACreatableRoot) {
     SCOPED_TRACE(c.path.substr(0, 40));
     capture.Clear();
     EXPECT_EQ(ValidateMountPoint(c.path), c.result);
-    EXPECT_EQ(DefaultLines(), c.lines);
+    EXPECT_EQ(capture.Texts(log::Level::Default), c.lines);
   }
   // Every entry of a full directory is named, not just the first.
   capture.Clear();
@@ -139,7 +132,7 @@ TEST_F(MountLocationsTest, OnlyCanonicalLinkFreeExistingPathsAreSafe) {
     SCOPED_TRACE(c.path.substr(0, 40));
     capture.Clear();
     EXPECT_EQ(IsUnsafePath(c.path), !c.line.empty());
-    EXPECT_EQ(DefaultLines(), c.line.empty() ? std::vector<std::string>{} : std::vector{c.line});
+    EXPECT_EQ(capture.Texts(log::Level::Default), c.line.empty() ? std::vector<std::string>{} : std::vector{c.line});
   }
 }
 

@@ -63,14 +63,6 @@ struct VerifiedMountTest : ::testing::Test {
     os.mounts.push_back({os::kMountReadOnly, "ext4", mountPath, "/dev/" + bsdName});
   }
 
-  std::vector<std::string> DefaultLines() const {
-    std::vector<std::string> lines;
-    for (const log::Line& line : capture.Lines()) {
-      if (line.level == log::Level::Default) lines.push_back(line.text);
-    }
-    return lines;
-  }
-
   testing::FileTreeOs os;
   registry::RegistryModel registry;
   log::CaptureSink capture;
@@ -126,7 +118,7 @@ TEST_F(VerifiedMountTest, EachStepEndsTheAttemptWithItsLineUndoesWhatItMadeAndCo
     capture.Clear();
     c.arrange(*this);
     EXPECT_EQ(Mount("Developer", c.mountPath).deviceNode.has_value(), std::string(c.name) == "mounted");
-    EXPECT_EQ(DefaultLines(), c.lines);
+    EXPECT_EQ(capture.Texts(log::Level::Default), c.lines);
     EXPECT_EQ(os.calls, c.calls);
   }
 }
@@ -137,14 +129,14 @@ TEST_F(VerifiedMountTest, DigestComesFromTheVerifiedDescriptorAndFindsAnIdentica
   const VerifiedMountResult result = Mount("Factory", "/private/var/factory_mount/new");
   EXPECT_FALSE(result.deviceNode);
   EXPECT_EQ(result.existingMountPath, "/private/var/factory_mount/abc");
-  EXPECT_THAT(DefaultLines(), ElementsAre("Matching image of type Factory/(null) found."));
+  EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre("Matching image of type Factory/(null) found."));
   EXPECT_THAT(os.calls, ElementsAre(std::string("open-image ") + kImage, std::string("unlink ") + kImage));
 
   // A digest length the manifest cannot ask for stops before anything is looked up.
   os.AddFile(kImage, kFile);
   capture.Clear();
   EXPECT_FALSE(Mount("Personalized", "/private/var/personalized_debug", ManifestWithDigestLength(32)).imageDigest);
-  EXPECT_THAT(DefaultLines(), ElementsAre("Unsupported digest size: 32", "Failed to digest data.",
+  EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre("Unsupported digest size: 32", "Failed to digest data.",
                                           "Failed to digest /private/var/stage/image.img."));
 }
 
@@ -187,7 +179,7 @@ TEST_F(VerifiedMountTest, AttachCarriesTheVerifiedIdentityAndStopsWhenTheLeaseWa
   os.AddFile(kImage, kFile);
   os.leaseHeld = false;
   EXPECT_FALSE(AttachAndMountImage(kImage, "/Developer", &file));
-  EXPECT_THAT(DefaultLines(), ElementsAre("/private/var/stage/image.img was opened for writing after it was verified."));
+  EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre("/private/var/stage/image.img was opened for writing after it was verified."));
   EXPECT_THAT(os.calls, ElementsAre("open /dev/loop3", "eject"));
 }
 

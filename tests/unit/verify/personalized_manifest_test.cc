@@ -56,14 +56,6 @@ class PersonalizedManifestTest : public ::testing::TestWithParam<Case> {
   testing::ScratchDir dir_;
 };
 
-Lines DefaultLines(const log::CaptureSink& capture) {
-  Lines lines;
-  for (const log::Line& line : capture.Lines()) {
-    if (line.level == Level::Default) lines.push_back(line.text);
-  }
-  return lines;
-}
-
 TEST_P(PersonalizedManifestTest, ChecksDeviceAndImage) {
   const Case& c = GetParam();
   std::string image = (dir_ / "image").string();
@@ -85,7 +77,7 @@ TEST_P(PersonalizedManifestTest, ChecksDeviceAndImage) {
   ASSERT_EQ(DigestImageFile(image, &digest, c.digestLength), 0);
   log::CaptureSink capture;
   EXPECT_EQ(VerifyPersonalizedManifest(testing::ReadBytes(dir_ / "manifest"), digest), c.result);
-  Lines lines = DefaultLines(capture);
+  Lines lines = capture.Texts(Level::Default);
   EXPECT_EQ(lines, c.lastLines);
 }
 
