@@ -2,6 +2,7 @@
 // platform interfaces, optionally enters a sandbox root, and runs the daemon.
 #include <sys/resource.h>
 
+#include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
@@ -36,6 +37,7 @@ struct Options {
   std::optional<std::string> devicesFile;
   bool teardown = false;
   bool verbose = false;
+  std::optional<std::chrono::milliseconds> keepAlive;
 };
 
 void PrintUsage(FILE* out) {
@@ -45,7 +47,10 @@ void PrintUsage(FILE* out) {
       "  --teardown      with --root: unmount everything under DIR, detach its loop\n"
       "                  devices and remove DIR, then exit\n"
       "  --devices FILE  publish the simulated devices described in FILE\n"
-      "  --verbose       log debug lines\n",
+      "  --verbose       log debug lines\n"
+      "  --test-keep-alive-ms MS\n"
+      "                  tests only: hold each subscription's keep-alive for MS\n"
+      "                  milliseconds instead of 15 seconds\n",
       out);
 }
 
@@ -63,6 +68,14 @@ std::optional<Options> ParseOptions(int argc, char** argv) {
       if (!(options.devicesFile = value())) return std::nullopt;
     } else if (arg == "--teardown") {
       options.teardown = true;
+    } else if (arg == "--test-keep-alive-ms") {
+      std::optional<std::string> text = value();
+      char* end = nullptr;
+      const long milliseconds = text ? std::strtol(text->c_str(), &end, 10) : 0;
+      if (!text || text->empty() || *end != '\0' || milliseconds <= 0 || milliseconds > 3'600'000) {
+        return std::nullopt;
+      }
+      options.keepAlive = std::chrono::milliseconds(milliseconds);
     } else if (arg == "--verbose" || arg == "-v") {
       options.verbose = true;
     } else if (arg == "--help" || arg == "-h") {
@@ -142,7 +155,9 @@ int main(int argc, char** argv) {
       return kExitUsage;
     }
   }
-  std::unique_ptr<ipc::IpcService> ipc = CreateLinuxIpcService(loop, IpcOptions{});
+  IpcOptions ipcOptions;
+  ipcOptions.transactionCountPath = ipcOptions.socketDirectory + "/brisvale-mounterd.transactions";
+  std::unique_ptr<ipc::IpcService> ipc = CreateLinuxIpcService(loop, ipcOptions);
   std::unique_ptr<notify::SystemNotify> notifier = notify::CreateLinuxSystemNotify();
   jobs::SpoolJobLauncher jobLauncher;
   std::unique_ptr<alert::UserAlertService> alerts = alert::CreateLinuxUserAlertService(loop);
@@ -154,6 +169,7 @@ int main(int argc, char** argv) {
   BackgroundQueue backgroundQueue;
   MatchingContext context;
   context.backgroundQueue = &backgroundQueue;
+  if (options->keepAlive) context.keepAlive = *options->keepAlive;
   auto port = registry.CreateNotificationPort();
   if (!port.ok() || !port.value) {
     Log(Level::Default, "Failed to create registry notification port: 0x%04x",

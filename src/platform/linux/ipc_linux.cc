@@ -1,11 +1,18 @@
 #include "platform/linux/ipc_linux.h"
 
+#include <fcntl.h>
+#include <sys/mman.h>
+#include <unistd.h>
+
 #include <atomic>
+#include <cerrno>
+#include <cstdint>
 #include <utility>
 #include <vector>
 
 #include "base/log.h"
 #include "base/runloop.h"
+#include "base/unique_fd.h"
 #include "platform/linux/ipc_connection.h"
 #include "platform/linux/ipc_events.h"
 #include "platform/linux/ipc_listener.h"
@@ -20,6 +27,45 @@ bool IsPlainName(std::string_view name) {
   return !name.empty() && name != "." && name != ".." && name.find('/') == std::string_view::npos &&
          name.find('\0') == std::string_view::npos;
 }
+
+// The transaction counter, in a shared mapping of the export file when there is one and
+// in the process otherwise. The file goes with the service; one left by a daemon that was
+// killed keeps its last count until the next start resets it.
+class TransactionCounter {
+ public:
+  TransactionCounter() = default;
+  // Moves the count into a shared mapping of `path`; it stays in the process when that
+  // fails.
+  void ExportTo(std::string path) {
+    path_ = std::move(path);
+    UniqueFd fd(::open(path_.c_str(), O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0644));
+    void* page = MAP_FAILED;
+    if (fd && ::ftruncate(fd.get(), sizeof(int32_t)) == 0) {
+      page = ::mmap(nullptr, sizeof(int32_t), PROT_READ | PROT_WRITE, MAP_SHARED, fd.get(), 0);
+    }
+    if (page == MAP_FAILED) {
+      Log(Level::Default, "Cannot export the transaction count at %s: %{errno}d", path_, errno);
+      path_.clear();
+      return;
+    }
+    shared_ = static_cast<int32_t*>(page);
+    *shared_ = local_;
+  }
+  ~TransactionCounter() {
+    if (!shared_) return;
+    ::munmap(shared_, sizeof(int32_t));
+    ::unlink(path_.c_str());
+  }
+  TransactionCounter(const TransactionCounter&) = delete;
+  TransactionCounter& operator=(const TransactionCounter&) = delete;
+
+  std::atomic_ref<int32_t> value() const { return std::atomic_ref<int32_t>(shared_ ? *shared_ : local_); }
+
+ private:
+  std::string path_;
+  int32_t* shared_ = nullptr;
+  alignas(std::atomic_ref<int32_t>::required_alignment) mutable int32_t local_ = 0;
+};
 
 class LinuxIpcService : public ipc::IpcService {
  public:
@@ -37,6 +83,8 @@ class LinuxIpcService : public ipc::IpcService {
     }
     hub_ = std::make_shared<ipc::EventHub>(context_, EventsSocketPath(options_), options_.kernelDeviceEvents,
                                            std::move(activatedEvents));
+    // After the event hub, which creates the socket directory the file usually lives in.
+    if (!options_.transactionCountPath.empty()) transactions_.ExportTo(options_.transactionCountPath);
   }
 
   ~LinuxIpcService() override {
@@ -71,16 +119,16 @@ class LinuxIpcService : public ipc::IpcService {
     return std::make_unique<ipc::LinuxEventStream>(hub_, id);
   }
 
-  void BeginTransaction() override { transactions_.fetch_add(1, std::memory_order_relaxed); }
-  void EndTransaction() override { transactions_.fetch_sub(1, std::memory_order_relaxed); }
-  int TransactionCount() const override { return transactions_.load(std::memory_order_relaxed); }
+  void BeginTransaction() override { transactions_.value().fetch_add(1, std::memory_order_relaxed); }
+  void EndTransaction() override { transactions_.value().fetch_sub(1, std::memory_order_relaxed); }
+  int TransactionCount() const override { return transactions_.value().load(std::memory_order_relaxed); }
 
  private:
   IpcOptions options_;
+  TransactionCounter transactions_;
   std::shared_ptr<ipc::TransportContext> context_;
   std::shared_ptr<ipc::EventHub> hub_;
   std::vector<UniqueFd> activated_;
-  std::atomic<int> transactions_{0};
 };
 
 }  // namespace

@@ -27,6 +27,10 @@ struct IpcOptions {
   size_t outgoingQueueLimit = size_t{8} << 20;
   // Translate kernel device events into the hardware matching stream.
   bool kernelDeviceEvents = true;
+  // Where the keep-alive transaction count is exported for the launcher: a file holding
+  // one native-endian 32-bit signed integer at offset 0, shared-mapped so that the count
+  // is always current without a write per change. Empty: not exported.
+  std::string transactionCountPath;
 };
 
 // The socket path that serves `serviceName` under `options`.
