@@ -8,7 +8,6 @@
 #include <filesystem>
 #include <fstream>
 #include <set>
-#include <sstream>
 #include <string>
 
 #include "platform/linux/os_system.h"
@@ -22,17 +21,13 @@ std::string DeviceNumberText(dev_t device) {
   return std::to_string(major(device)) + ":" + std::to_string(minor(device));
 }
 
-// "major:minor" of every mounted file system this process can see.
-std::set<std::string> MountedDeviceNumbers(const std::string& mountInfoPath) {
-  std::set<std::string> mounted;
-  std::ifstream table(mountInfoPath);
-  std::string line;
-  while (std::getline(table, line)) {
-    std::istringstream fields(line);
-    std::string id, parent, device;
-    if (fields >> id >> parent >> device) mounted.insert(device);
-  }
-  return mounted;
+// The device number a sysfs directory's "dev" file holds as "major:minor"; 0 if unreadable.
+dev_t PartitionDevice(const fs::path& partition) {
+  unsigned int majorNumber = 0, minorNumber = 0;
+  std::ifstream numberFile(partition / "dev");
+  char colon = 0;
+  if (!(numberFile >> majorNumber >> colon >> minorNumber) || colon != ':') return 0;
+  return makedev(majorNumber, minorNumber);
 }
 
 }  // namespace
@@ -43,12 +38,11 @@ bool DiskHasMountedPartition(dev_t device, const std::string& sysRoot, const std
   if (error) return false;
   // A partition's sysfs directory sits inside its disk's.
   const fs::path disk = fs::exists(node / "partition", error) ? node.parent_path() : node;
-  const std::set<std::string> mounted = MountedDeviceNumbers(mountInfoPath);
-  for (const fs::directory_entry& entry : fs::directory_iterator(disk, error)) {
-    if (!fs::exists(entry.path() / "partition", error)) continue;
-    std::ifstream numberFile(entry.path() / "dev");
-    std::string number;
-    if (numberFile >> number && mounted.count(number)) return true;
+  std::set<dev_t> mounted;
+  if (ReadMountedDevices(mountInfoPath.c_str(), mounted) < 0) return false;
+  for (fs::directory_iterator entry(disk, error), end; !error && entry != end; entry.increment(error)) {
+    std::error_code ignored;
+    if (fs::exists(entry->path() / "partition", ignored) && mounted.count(PartitionDevice(entry->path()))) return true;
   }
   return false;
 }

@@ -8,6 +8,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <memory>
+#include <set>
 #include <vector>
 
 #include "base/c_handle.h"
@@ -28,16 +29,27 @@ struct FileCloser {
   void operator()(FILE* stream) const { std::fclose(stream); }
 };
 
-// Parses a table in the kernel's mountinfo format from `stream`.
-int ParseMountTable(FILE* stream, std::vector<MountRecord>& records) {
+// Calls `visit` with each file system of the table in the kernel's mountinfo format in
+// `stream`; the count of them, or a negative error.
+template <typename Visit>
+int ForEachMount(FILE* stream, Visit visit) {
   CHandle<libmnt_table, mnt_unref_table> table(mnt_new_table());
   CHandle<libmnt_iter, mnt_free_iter> iter(mnt_new_iter(MNT_ITER_FORWARD));
   if (!table || !iter) return -ENOMEM;
   // The parser decodes the table's octal escapes (a space is written \040).
   if (int rc = mnt_table_parse_stream(table.get(), stream, "mountinfo"); rc != 0) return rc < 0 ? rc : -EINVAL;
-  records.clear();
+  int count = 0;
   libmnt_fs* fs = nullptr;
   while (mnt_table_next_fs(table.get(), iter.get(), &fs) == 0) {
+    visit(fs);
+    ++count;
+  }
+  return count;
+}
+
+int ParseMountTable(FILE* stream, std::vector<MountRecord>& records) {
+  records.clear();
+  return ForEachMount(stream, [&records](libmnt_fs* fs) {
     MountRecord record;
     // Read-only either for this mount or for the whole file system.
     if (HasOption(mnt_fs_get_vfs_options(fs), "ro") || HasOption(mnt_fs_get_fs_options(fs), "ro")) {
@@ -47,8 +59,7 @@ int ParseMountTable(FILE* stream, std::vector<MountRecord>& records) {
     record.mountedOn = Text(mnt_fs_get_target(fs));
     record.mountedFrom = Text(mnt_fs_get_source(fs));
     records.push_back(std::move(record));
-  }
-  return static_cast<int>(records.size());
+  });
 }
 
 // The daemon sees the table through fixed-size fields: paths of at most 1023 bytes and
@@ -77,6 +88,13 @@ int ReadWholeMountTable(const char* path, std::vector<MountRecord>& records) {
   std::unique_ptr<FILE, FileCloser> stream(std::fopen(path, "re"));
   if (!stream) return -errno;
   return ParseMountTable(stream.get(), records);
+}
+
+int ReadMountedDevices(const char* path, std::set<dev_t>& devices) {
+  std::unique_ptr<FILE, FileCloser> stream(std::fopen(path, "re"));
+  if (!stream) return -errno;
+  devices.clear();
+  return ForEachMount(stream.get(), [&devices](libmnt_fs* fs) { devices.insert(mnt_fs_get_devno(fs)); });
 }
 
 int ReadMountTable(const char* path, std::span<MountRecord> records) {

@@ -4,6 +4,7 @@
 
 #include <sys/types.h>
 
+#include <set>
 #include <span>
 #include <string>
 #include <vector>
@@ -79,5 +80,7 @@ int ReadMountTable(const char* path, std::span<MountRecord> records);
 // The whole table at `path`, fields uncut (for the sandbox, which must name every
 // mount exactly); its size or -errno.
 int ReadWholeMountTable(const char* path, std::vector<MountRecord>& records);
+// The device numbers of the file systems in the table at `path`; their count or -errno.
+int ReadMountedDevices(const char* path, std::set<dev_t>& devices);
 
 }  // namespace brisvale::os
