@@ -37,18 +37,19 @@ timespec ToTimespec(std::chrono::nanoseconds duration) {
 
 }  // namespace
 
-// Each source keeps its own descriptor: a duplicate of the caller's fd, or its timerfd.
-// Registering the duplicate means removal always finds the registration, even when the
-// caller has already closed its fd or a spawned child still holds the file open, and two
-// sources may watch the same fd.
+// A source normally keeps its own descriptor: a duplicate of the caller's fd, or its
+// timerfd. Registering the duplicate means removal always finds the registration, even
+// when the caller has already closed its fd or a spawned child still holds the file
+// open, and two sources may watch the same fd. WatchFd sources borrow the caller's.
 struct RunLoop::Source {
   int fd = -1;
+  bool owned = true;
   bool isTimer = false;
   bool repeating = false;
   FdCallback onReady;
   Task onTimer;
   ~Source() {
-    if (fd >= 0) ::close(fd);
+    if (owned && fd >= 0) ::close(fd);
   }
 };
 
@@ -107,9 +108,19 @@ void RunLoop::Post(Task task) {
 }
 
 SourceHandle RunLoop::AddFd(int fd, uint32_t events, FdCallback callback) {
+  const int duplicate = ::fcntl(fd, F_DUPFD_CLOEXEC, 0);
+  if (duplicate < 0) return {};
+  return AddSource(duplicate, true, events, std::move(callback));
+}
+
+SourceHandle RunLoop::WatchFd(int fd, uint32_t events, FdCallback callback) {
+  return AddSource(fd, false, events, std::move(callback));
+}
+
+SourceHandle RunLoop::AddSource(int fd, bool owned, uint32_t events, FdCallback callback) {
   auto source = std::make_shared<Source>();
-  source->fd = ::fcntl(fd, F_DUPFD_CLOEXEC, 0);
-  if (source->fd < 0) return {};
+  source->fd = fd;
+  source->owned = owned;
   source->onReady = std::move(callback);
   uint64_t id = nextId_++;
   epoll_event event{};

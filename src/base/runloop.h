@@ -61,6 +61,9 @@ class RunLoop {
   // Calls back on the loop thread while fd is ready for `events` (EPOLLIN, EPOLLOUT...).
   // The loop does not own fd.
   SourceHandle AddFd(int fd, uint32_t events, FdCallback callback);
+  // AddFd without the loop's own duplicate of fd, for sources there are many of (one per
+  // client connection): the caller keeps fd open until the handle is gone.
+  SourceHandle WatchFd(int fd, uint32_t events, FdCallback callback);
   // Changes the events a source waits for (for instance to add EPOLLOUT while a
   // connection has bytes queued).
   bool ModifyFd(const SourceHandle& handle, uint32_t events);
@@ -83,6 +86,7 @@ class RunLoop {
   friend class SourceHandle;
   struct Source;
   void Remove(uint64_t id);
+  SourceHandle AddSource(int fd, bool owned, uint32_t events, FdCallback callback);
   // Handles what is ready (waiting up to timeoutMs for something), returning early once
   // `done` says so; what is left stays pending for the next call.
   int Dispatch(int timeoutMs, const std::function<bool()>* done = nullptr);

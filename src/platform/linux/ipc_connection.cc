@@ -108,7 +108,7 @@ void LinuxConnection::UpdateInterest() {
   interest_ = wanted;
   if (!source_) {
     if (wanted == 0) return;
-    source_ = context_->loop.AddFd(socket_.get(), wanted, [this](uint32_t events) { OnReady(events); });
+    source_ = context_->loop.WatchFd(socket_.get(), wanted, [this](uint32_t events) { OnReady(events); });
   } else {
     context_->loop.ModifyFd(source_, wanted);
   }
