@@ -86,12 +86,12 @@ int RemoveTree(const char* path, int removeStart) {
 
 void RemoveStaleMountPoints(const char* mountRoot) {
   os::Os& os = *CurrentServices().os;
-  std::vector<os::DirectoryEntry> entries;
-  const int listed = os.ReadDirectory(mountRoot, entries);
-  if (listed < 0 && entries.empty()) {
-    if (listed != -ENOENT) Log(Level::Default, "Failed to open %s: %{errno}d", mountRoot, -listed);
+  const os::DirectoryListing listing = os.ReadDirectory(mountRoot);
+  if (listing.openError < 0) {
+    if (listing.openError != -ENOENT) Log(Level::Default, "Failed to open %s: %{errno}d", mountRoot, -listing.openError);
     return;
   }
+  const std::vector<os::DirectoryEntry>& entries = listing.entries;
   const std::vector<std::string> mountedPaths = entries.empty() ? std::vector<std::string>() : MountedPaths(os);
   std::string resolvedRoot;
   if (!entries.empty() && os.RealPath(mountRoot, resolvedRoot) < 0) resolvedRoot = mountRoot;
@@ -126,7 +126,7 @@ void RemoveStaleMountPoints(const char* mountRoot) {
       }
     }
   }
-  if (listed < 0) Log(Level::Default, "Failed to close %s: %{errno}d", mountRoot, -listed);
+  if (listing.closeError < 0) Log(Level::Default, "Failed to close %s: %{errno}d", mountRoot, -listing.closeError);
 }
 
 }  // namespace brisvale

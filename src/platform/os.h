@@ -55,6 +55,14 @@ struct DirectoryEntry {
   bool isLink = false;       // a symbolic link, which is never a directory here
 };
 
+// A directory's entries in directory order. A read error ends the listing as its end
+// does; a failure to close it leaves the entries good.
+struct DirectoryListing {
+  int openError = 0;   // -errno when the directory could not be opened (no entries)
+  int closeError = 0;  // -errno when closing it failed
+  std::vector<DirectoryEntry> entries;
+};
+
 // A node of a tree walk (see WalkTree).
 struct TreeNode {
   enum class Kind {
@@ -150,10 +158,7 @@ class Os {
   // The number of the block device open on `fd`, or -ENOTBLK.
   virtual int DeviceNumber(int fd, uint64_t& device) = 0;
 
-  // The entries of `path` in directory order, or -errno when it cannot be opened
-  // (`entries` then stays empty) or closed (`entries` filled). A read error ends the
-  // listing like its end.
-  virtual int ReadDirectory(const char* path, std::vector<DirectoryEntry>& entries) = 0;
+  virtual DirectoryListing ReadDirectory(const char* path) = 0;
   // The canonical path, or -errno.
   virtual int RealPath(const char* path, std::string& resolved) = 0;
   // Clears the immutable and append-only flags. Links have none; FIFOs and device

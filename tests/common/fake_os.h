@@ -47,7 +47,7 @@ class FakeOs : public os::Os {
     device = 1;
     return 0;
   }
-  int ReadDirectory(const char*, std::vector<os::DirectoryEntry>&) override { return -ENOSYS; }
+  os::DirectoryListing ReadDirectory(const char*) override { return {-ENOSYS, 0, {}}; }
   int RealPath(const char*, std::string&) override { return -ENOSYS; }
   int ClearFlags(const char*) override { return -ENOSYS; }
   os::TreeWalk WalkTree(const char*, const std::function<bool(const os::TreeNode&)>&) override {

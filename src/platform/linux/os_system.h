@@ -30,7 +30,7 @@ class LinuxOs final : public Os {
   int MountedDevice(const char* path, uint64_t& device) override;
   int DeviceNumber(int fd, uint64_t& device) override;
   // os_tree.cc
-  int ReadDirectory(const char* path, std::vector<DirectoryEntry>& entries) override;
+  DirectoryListing ReadDirectory(const char* path) override;
   int RealPath(const char* path, std::string& resolved) override;
   int ClearFlags(const char* path) override;
   TreeWalk WalkTree(const char* root, const std::function<bool(const TreeNode&)>& visit) override;

@@ -89,23 +89,26 @@ int Status(int rc) { return rc == 0 ? 0 : -errno; }
 
 }  // namespace
 
-int LinuxOs::ReadDirectory(const char* path, std::vector<DirectoryEntry>& entries) {
-  entries.clear();
+DirectoryListing LinuxOs::ReadDirectory(const char* path) {
+  DirectoryListing listing;
   std::unique_ptr<DIR, DirCloser> dir(::opendir(path));
-  if (!dir) return -errno;
+  if (!dir) {
+    listing.openError = -errno;
+    return listing;
+  }
   const int dirFd = ::dirfd(dir.get());
   errno = 0;
   while (const dirent* entry = ::readdir(dir.get())) {
     const std::string_view name = entry->d_name;
     if (name == "." || name == "..") continue;
     const unsigned char type = entry->d_type == DT_UNKNOWN ? TypeAt(dirFd, entry->d_name) : entry->d_type;
-    entries.push_back({std::string(name), type == DT_DIR, type == DT_LNK});
+    listing.entries.push_back({std::string(name), type == DT_DIR, type == DT_LNK});
     errno = 0;
   }
   // A read error ends the listing as its end does: the entries read so far are served,
   // and the error is no failure to open or to close.
-  if (::closedir(dir.release()) != 0) return -errno;
-  return 0;
+  if (::closedir(dir.release()) != 0) listing.closeError = -errno;
+  return listing;
 }
 
 int LinuxOs::RealPath(const char* path, std::string& resolved) {

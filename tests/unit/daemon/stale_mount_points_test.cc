@@ -33,9 +33,7 @@ class TreeOs : public testing::FakeOs {
  public:
   int Unlink(const char* path) override { return real.Unlink(path); }
   int RemoveDirectory(const char* path) override { return real.RemoveDirectory(path); }
-  int ReadDirectory(const char* path, std::vector<os::DirectoryEntry>& entries) override {
-    return real.ReadDirectory(path, entries);
-  }
+  os::DirectoryListing ReadDirectory(const char* path) override { return real.ReadDirectory(path); }
   int RealPath(const char* path, std::string& resolved) override { return real.RealPath(path, resolved); }
   int ClearFlags(const char* path) override { return real.ClearFlags(path); }
   os::TreeWalk WalkTree(const char* root, const std::function<bool(const os::TreeNode&)>& visit) override {
