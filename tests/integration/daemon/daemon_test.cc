@@ -63,14 +63,23 @@ TEST_F(DaemonTest, ExecAfterConnectIsServedWithoutEntitlements) {
   const pid_t child = fork();
   if (child == 0) {
     char byte = 0;
+    close(go[1]);  // so that the read ends should the test end first
     if (dup2(ConnectTo(daemon.ServiceSocket()), kChildConnection) < 0 || read(go[0], &byte, 1) != 1) _exit(3);
     execl(client.c_str(), client.c_str(), "--root", daemon.root().c_str(), "watch", static_cast<char*>(nullptr));
     _exit(4);
   }
+  struct Reap {
+    pid_t pid;
+    ~Reap() { kill(pid, SIGKILL), waitpid(pid, nullptr, 0); }
+  } reap{child};
   const std::string self = std::filesystem::read_symlink("/proc/self/exe").filename().string();
-  ASSERT_TRUE(daemon.WaitForLogLine("debug: new vexa connection: " + self + "<" + std::to_string(child) + ">"));
+  EXPECT_TRUE(daemon.WaitForLogLine("debug: new vexa connection: " + self + "<" + std::to_string(child) + ">",
+                                    std::chrono::seconds(20)));
   const UniqueFd pidfd(static_cast<int>(syscall(SYS_pidfd_open, child, 0)));
-  const UniqueFd connection(static_cast<int>(syscall(SYS_pidfd_getfd, pidfd.get(), kChildConnection, 0)));
+  UniqueFd connection;  // the child may still be moving it into place
+  for (int i = 0; i < 500 && !connection; ++i, usleep(10000)) {
+    connection.Reset(static_cast<int>(syscall(SYS_pidfd_getfd, pidfd.get(), kChildConnection, 0)));
+  }
   ASSERT_TRUE(connection) << strerror(errno);
   ASSERT_EQ(write(go[1], "", 1), 1);
   const std::string exe = "/proc/" + std::to_string(child) + "/exe";
@@ -84,8 +93,6 @@ TEST_F(DaemonTest, ExecAfterConnectIsServedWithoutEntitlements) {
                                     " without entitlements: it no longer runs the program that connected"));
   EXPECT_TRUE(daemon.WaitForLogLine(
       "default: Missing required entitlement (will be required in <kelpie://problem/25909614>): SyncDevice"));
-  kill(child, SIGKILL);
-  waitpid(child, nullptr, 0);
   for (const int fd : go) close(fd);
   std::filesystem::remove(client);
 }

@@ -37,8 +37,11 @@ ipc::Message RequestCarrying(plist::Value encoded, std::optional<int64_t> id = 7
   return message;
 }
 
-ipc::Message Request(const plist::Value& dictionary) {
-  return RequestCarrying(plist::Value(plist::WriteBinary(dictionary)));
+// A request carrying `dictionary` in the binary format, or in XML, which is read as well.
+ipc::Message Request(const plist::Value& dictionary, bool xml = false, std::optional<int64_t> id = 7) {
+  const std::string text = xml ? plist::WriteXml(dictionary) : std::string();
+  return RequestCarrying(xml ? plist::Value(plist::Bytes(text.begin(), text.end()))
+                             : plist::Value(plist::WriteBinary(dictionary)), id);
 }
 
 plist::Value AllSPIs() {
@@ -52,16 +55,13 @@ struct Rejection {
 };
 
 TEST(HandleRequest, MalformedRequestsAreRejectedWithTheirLine) {
-  plist::Bytes xmlArray;
-  std::string xml = plist::WriteXml(plist::Array{"CopyDevices"});
-  xmlArray.assign(xml.begin(), xml.end());
   const Rejection cases[] = {
       {"no encoded dictionary", ipc::Message{}, "Invalid or missing value for EncodedDictionary."},
       {"encoded dictionary is text", RequestCarrying("RequestType"),
        "Invalid or missing value for EncodedDictionary."},
       {"undecodable bytes", RequestCarrying(plist::Bytes{'b', 'p', 'l', 'i', 's', 't', '0', '0', 1}),
        "Failed to create dictionary with data."},
-      {"top level is an array", RequestCarrying(plist::Value(xmlArray)),
+      {"top level is an array", Request(plist::Array{"CopyDevices"}, /*xml=*/true),
        "Invalid value for RequestType: (null)"},
       {"no request type", Request(plist::Dictionary{{"Other", "x"}}),
        "Invalid value for RequestType: (null)"},
@@ -86,17 +86,22 @@ TEST(HandleRequest, MalformedRequestsAreRejectedWithTheirLine) {
 }
 
 TEST(HandleRequest, EveryRequestTypeGetsABinaryReplyRoutedToTheCaller) {
-  for (const char* type : {"CopyDevices", "Mount", "Unmount", "Sync"}) {
-    SCOPED_TRACE(type);
+  const struct {
+    const char* type;
+    bool xml;
+    std::optional<int64_t> id;  // none: the reply carries none either
+  } cases[] = {{"CopyDevices", false, 7}, {"Mount", false, 7}, {"Unmount", false, std::nullopt}, {"Sync", true, 7}};
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.type);
     log::CaptureSink capture;
     FakeConnection connection;
     connection.allowedSPI = AllSPIs();
     MatchingContext context;
-    ASSERT_TRUE(HandleRequest(context, &connection, Request(plist::Dictionary{{"RequestType", type}})));
+    ASSERT_TRUE(HandleRequest(context, &connection, Request(plist::Dictionary{{"RequestType", c.type}}, c.xml, c.id)));
     ASSERT_EQ(connection.sent.size(), 1u);
     const ipc::Message& reply = connection.sent[0];
     EXPECT_TRUE(reply.isReply);
-    EXPECT_EQ(reply.replyToken, (plist::Integer{7, false}));
+    EXPECT_EQ(reply.replyToken, c.id ? std::optional(plist::Integer{*c.id, false}) : std::nullopt);
     const plist::Bytes* bytes = reply.body.find("EncodedDictionary")->data();
     ASSERT_NE(bytes, nullptr);
     ASSERT_GE(bytes->size(), 8u);
@@ -104,20 +109,8 @@ TEST(HandleRequest, EveryRequestTypeGetsABinaryReplyRoutedToTheCaller) {
     // Only a listing succeeds without further keys.
     const std::optional<plist::Value> decoded = plist::ReadBinary(*bytes);
     ASSERT_TRUE(decoded.has_value());
-    EXPECT_EQ(*decoded->get("Status"), plist::Value(type == std::string("CopyDevices") ? "Success" : "Failure"));
+    EXPECT_EQ(*decoded->get("Status"), plist::Value(c.type == std::string("CopyDevices") ? "Success" : "Failure"));
   }
-}
-
-TEST(HandleRequest, XmlRequestGetsBinaryReply) {
-  FakeConnection connection;
-  connection.allowedSPI = AllSPIs();
-  MatchingContext context;
-  std::string xml = plist::WriteXml(plist::Dictionary{{"RequestType", "Sync"}});
-  ASSERT_TRUE(HandleRequest(context, &connection,
-                            RequestCarrying(plist::Value(plist::Bytes(xml.begin(), xml.end())))));
-  ASSERT_EQ(connection.sent.size(), 1u);
-  const plist::Bytes& bytes = *connection.sent[0].body.find("EncodedDictionary")->data();
-  EXPECT_TRUE(plist::ReadBinary(bytes).has_value());
 }
 
 TEST(HandleRequest, MissingEntitlementIsLoggedAndRequestStillServed) {
@@ -150,17 +143,7 @@ TEST(HandleRequest, MissingEntitlementIsLoggedAndRequestStillServed) {
   }
 }
 
-TEST(HandleRequest, RequestWithoutIdGetsReplyWithoutOne) {
-  FakeConnection connection;
-  connection.allowedSPI = AllSPIs();
-  MatchingContext context;
-  ipc::Message message = Request(plist::Dictionary{{"RequestType", "Unmount"}});
-  message.replyToken.reset();
-  ASSERT_TRUE(HandleRequest(context, &connection, message));
-  EXPECT_FALSE(connection.sent.at(0).replyToken.has_value());
-}
-
-TEST(CopyClientName, NamesTheExecutableAndPid) {
+TEST(CopyClientName, NamesTheExecutableAndPidAndRefusesAbsentInputs) {
   struct Case {
     std::string path;
     std::string name;
@@ -177,17 +160,13 @@ TEST(CopyClientName, NamesTheExecutableAndPid) {
     connection.executablePath = c.path;
     EXPECT_EQ(CopyClientName(&connection), c.name) << c.path;
   }
-  log::CaptureSink capture;
-  EXPECT_EQ(CopyClientName(nullptr), std::nullopt);
-  EXPECT_THAT(capture.Texts(), ElementsAre("Invalid input."));
-}
-
-TEST(CheckAllowedSPI, MissingInputs) {
+  // Absent inputs are refused with a line.
   log::CaptureSink capture;
   FakeConnection connection;
+  EXPECT_EQ(CopyClientName(nullptr), std::nullopt);
   EXPECT_FALSE(CheckAllowedSPI(nullptr, "CopyDevices"));
   EXPECT_FALSE(CheckAllowedSPI(&connection, nullptr));
-  EXPECT_THAT(capture.Texts(), ElementsAre("Invalid inputs.", "Invalid inputs."));
+  EXPECT_THAT(capture.Texts(), ElementsAre("Invalid input.", "Invalid inputs.", "Invalid inputs."));
 }
 
 }  // namespace
