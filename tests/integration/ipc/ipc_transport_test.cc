@@ -72,10 +72,6 @@ struct RawPeer {
 
 Bytes FrameOf(const plist::Dictionary& body) { return *EncodeFrame(body); }
 
-Bytes Header(uint32_t length) {
-  return {uint8_t(length >> 24), uint8_t(length >> 16), uint8_t(length >> 8), uint8_t(length)};
-}
-
 plist::Value EntitledSPIs() { return plist::Array{"CopyDevices", "SyncDevice"}; }
 
 // This test program, copied and given entitlements, as a client of the echo service:
@@ -233,26 +229,19 @@ TEST_F(TransportTest, OverlappingClientsAreServedInArrivalOrder) {
 TEST_F(TransportTest, MalformedInputCancelsOnlyThatConnection) {
   Start();
   const Bytes valid = FrameOf({{"Tag", "x"}});
-  struct Case {
+  // One case per way a connection fails: the frame reader refuses (the ways it does are
+  // its own unit test's), the frame is no message, the frame never completes.
+  const struct {
     const char* name;
     Bytes bytes;
-  };
-  const Case cases[] = {
+  } cases[] = {
       {"garbage payload", {0, 0, 0, 5, 'h', 'e', 'l', 'l', 'o'}},
-      {"length above 4 MiB", Header((4u << 20) + 1)},
-      {"zero length", Header(0)},
-      {"array frame", [] {
-         Bytes payload = plist::WriteBinary(plist::Array{"a"});
-         Bytes frame = Header(uint32_t(payload.size()));
-         frame.insert(frame.end(), payload.begin(), payload.end());
-         return frame;
-       }()},
       {"id that is not an integer", FrameOf({{"vexa.id", "one"}})},
       {"half a frame, then silence", Bytes(valid.begin(), valid.end() - 3)},
   };
   std::optional<Client> bystander = Client::Connect(SocketPath());
   ASSERT_TRUE(bystander);
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     SCOPED_TRACE(c.name);
     const int invalidBefore = invalidEvents_;
     RawPeer bad(SocketPath());
