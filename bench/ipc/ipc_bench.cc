@@ -6,7 +6,6 @@
 
 #include <benchmark/benchmark.h>
 
-#include <filesystem>
 #include <thread>
 
 #include "base/runloop.h"
@@ -14,6 +13,7 @@
 #include "platform/linux/ipc_frame.h"
 #include "platform/linux/ipc_linux.h"
 #include "platform/linux/ipc_message.h"
+#include "test_files.h"
 
 namespace brisvale::ipc {
 namespace {
@@ -24,10 +24,9 @@ plist::Dictionary TypicalRequest() {
 }
 
 void BM_TransportRoundTrip(benchmark::State& state) {
-  char pattern[] = "/tmp/ipc-bench-XXXXXX";
-  if (!mkdtemp(pattern)) return state.SkipWithError("mkdtemp failed");
+  const brisvale::testing::ScratchDir scratch;
   IpcOptions options;
-  options.socketDirectory = pattern;
+  options.socketDirectory = scratch.str();
   options.kernelDeviceEvents = false;
   RunLoop loop;
   std::unique_ptr<IpcService> service = CreateLinuxIpcService(loop, options);
@@ -60,7 +59,6 @@ void BM_TransportRoundTrip(benchmark::State& state) {
   thread.join();
   listener.reset();
   service.reset();
-  std::filesystem::remove_all(pattern);
 }
 BENCHMARK(BM_TransportRoundTrip)->UseRealTime();
 

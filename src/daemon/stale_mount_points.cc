@@ -19,17 +19,12 @@ namespace {
 // being emptied too. Empty when the table cannot be read.
 std::vector<std::string> MountedPaths(os::Os& os) {
   std::vector<os::MountRecord> records;
-  int count = os.GetMountTable(records);
-  if (count > 0) {
-    records.resize(static_cast<size_t>(count));
-    count = os.GetMountTable(records);
-  }
-  if (count < 0) {
+  if (const int count = os::CopyMountTable(os, records); count < 0) {
     Log(Level::Default, "Failed to read the mount table: %{errno}d", -count);
     return {};
   }
   std::vector<std::string> paths;
-  for (int i = 0; i < count; ++i) paths.push_back(std::move(records[static_cast<size_t>(i)].mountedOn));
+  for (os::MountRecord& record : records) paths.push_back(std::move(record.mountedOn));
   return paths;
 }
 

@@ -8,56 +8,49 @@ namespace {
 
 using Bytes = std::vector<uint8_t>;
 
-struct TextCase {
-  const char* why;
-  std::string text;  // UTF-8
-  std::optional<Bytes> expected;
-};
-void PrintTo(const TextCase& c, std::ostream* out) { *out << c.why; }
+TEST(Hex, TextToBytes) {
+  const struct {
+    const char* why;
+    std::string text;  // UTF-8
+    std::optional<Bytes> expected;
+  } cases[] = {
+      {"mixed case pairs", "0a1B", Bytes{0x0A, 0x1B}},
+      {"odd length gains a leading zero", "A1B", Bytes{0x0A, 0x1B}},
+      {"empty text", "", Bytes{}},
+      // Letters that are not hex digits pass the check and stop strtol.
+      {"no digit at all", "ZZ", Bytes{0x00}},
+      {"non-digit first", "G1", Bytes{0x00}},
+      {"non-digit second", "1G", Bytes{0x01}},
+      // Other letters, marks and digits are parsed from the low byte of their code unit.
+      {"U+0120 low byte is a blank, which strtol skips", "\u01205", Bytes{0x05}},
+      {"U+012D low byte is a minus sign", "\u012D5", Bytes{0xFB}},
+      {"U+0100 low byte is NUL, which ends the text", "\u01005", Bytes{0x00}},
+      {"Arabic-Indic digits U+0661 U+0662 read as 'a' 'b'", "\u0661\u0662", Bytes{0xAB}},
+      {"combining mark U+0E31 reads as '1'", "A\u0E31", Bytes{0xA1}},
+      {"title-case, modifier, Roman numeral, superscript", "\u01C5\u02B0\u2160\u00B2", Bytes{0x00, 0x00}},
+      // U+1D400 is the two UTF-16 units D835 DC00: one pair, and one more unit makes
+      // the length odd.
+      {"non-BMP letter is one pair", "\U0001D400", Bytes{0x05}},
+      {"non-BMP letter plus digit has odd length", "\U0001D4001", Bytes{0x05, 0x00}},
+      {"hyphen", "0a-1b", std::nullopt},
+      {"leading blank", " 0a", std::nullopt},
+      {"trailing blank", "0a ", std::nullopt},
+      {"underscore", "0_", std::nullopt},
+      {"embedded NUL", std::string("0\0a", 3), std::nullopt},
+      {"no-break space", "0a\u00A0", std::nullopt},
+      {"multiplication sign between letter ranges", "0\u00D7", std::nullopt},
+      {"emoji", "0a\U0001F600", std::nullopt},
+      {"truncated UTF-8", "0a\xC3", std::nullopt},
+      {"overlong UTF-8", "\xC0\xB0", std::nullopt},
+      {"UTF-8 surrogate", "\xED\xA0\x80", std::nullopt},
+      {"above U+10FFFF", "\xF4\x90\x80\x80", std::nullopt},
+      {"stray continuation byte", "\x80", std::nullopt},
+  };
+  for (const auto& c : cases) EXPECT_EQ(dataWithHexString(c.text), c.expected) << c.why;
+  EXPECT_EQ(dataWithHexString(std::nullopt), std::nullopt);
+}
 
-class TextToBytes : public testing::TestWithParam<TextCase> {};
-
-TEST_P(TextToBytes, Converts) { EXPECT_EQ(dataWithHexString(GetParam().text), GetParam().expected); }
-
-INSTANTIATE_TEST_SUITE_P(
-    Cases, TextToBytes,
-    testing::Values(
-        TextCase{"mixed case pairs", "0a1B", Bytes{0x0A, 0x1B}},
-        TextCase{"odd length gains a leading zero", "A1B", Bytes{0x0A, 0x1B}},
-        TextCase{"empty text", "", Bytes{}},
-        // Letters that are not hex digits pass the check and stop strtol.
-        TextCase{"no digit at all", "ZZ", Bytes{0x00}},
-        TextCase{"non-digit first", "G1", Bytes{0x00}},
-        TextCase{"non-digit second", "1G", Bytes{0x01}},
-        // Other letters, marks and digits are parsed from the low byte of their code unit.
-        TextCase{"U+0120 low byte is a blank, which strtol skips", "\u01205", Bytes{0x05}},
-        TextCase{"U+012D low byte is a minus sign", "\u012D5", Bytes{0xFB}},
-        TextCase{"U+0100 low byte is NUL, which ends the text", "\u01005", Bytes{0x00}},
-        TextCase{"Arabic-Indic digits U+0661 U+0662 read as 'a' 'b'", "\u0661\u0662", Bytes{0xAB}},
-        TextCase{"combining mark U+0E31 reads as '1'", "A\u0E31", Bytes{0xA1}},
-        TextCase{"title-case, modifier, Roman numeral, superscript", "\u01C5\u02B0\u2160\u00B2",
-                 Bytes{0x00, 0x00}},
-        // U+1D400 is the two UTF-16 units D835 DC00: one pair, and one more unit makes
-        // the length odd.
-        TextCase{"non-BMP letter is one pair", "\U0001D400", Bytes{0x05}},
-        TextCase{"non-BMP letter plus digit has odd length", "\U0001D4001", Bytes{0x05, 0x00}},
-        TextCase{"hyphen", "0a-1b", std::nullopt},
-        TextCase{"leading blank", " 0a", std::nullopt},
-        TextCase{"trailing blank", "0a ", std::nullopt},
-        TextCase{"underscore", "0_", std::nullopt},
-        TextCase{"embedded NUL", std::string("0\0a", 3), std::nullopt},
-        TextCase{"no-break space", "0a\u00A0", std::nullopt},
-        TextCase{"multiplication sign between letter ranges", "0\u00D7", std::nullopt},
-        TextCase{"emoji", "0a\U0001F600", std::nullopt},
-        TextCase{"truncated UTF-8", "0a\xC3", std::nullopt},
-        TextCase{"overlong UTF-8", "\xC0\xB0", std::nullopt},
-        TextCase{"UTF-8 surrogate", "\xED\xA0\x80", std::nullopt},
-        TextCase{"above U+10FFFF", "\xF4\x90\x80\x80", std::nullopt},
-        TextCase{"stray continuation byte", "\x80", std::nullopt}));
-
-TEST(TextToBytes, AbsentTextGivesNothing) { EXPECT_EQ(dataWithHexString(std::nullopt), std::nullopt); }
-
-TEST(BytesToText, UpperCaseTwoDigitsPerByte) {
+TEST(Hex, BytesToUpperCaseTextTwoDigitsPerByte) {
   EXPECT_EQ(hexStringWithData(Bytes{0x00, 0xAB, 0xFF, 0x19}), "00ABFF19");
   EXPECT_EQ(hexStringWithData(Bytes{}), "");
   EXPECT_EQ(hexStringWithData(std::nullopt), std::nullopt);

@@ -2,7 +2,6 @@
 #include "base/log.h"
 
 #include <gtest/gtest.h>
-#include <unistd.h>
 
 #include <cerrno>
 #include <climits>
@@ -110,12 +109,11 @@ TEST(LogFormat, LongValuesAreCutEarly) {
   EXPECT_EQ(Format("%@", {Value(plist::Array(2, Value(plist::Bytes{1})))}), "[<01>, <01>]");
 }
 
-TEST(LogCapture, RecordsLevelsGatesDebugAndRestoresWhatWasBefore) {
+TEST(LogCapture, RecordsLevelsGatesDebugRestoresWhatWasBeforeAndTakesAnyThread) {
   SetDebugEnabled(false);
   CaptureSink outer;
   SetDebugEnabled(false);
   std::optional<CaptureSink> inner(std::in_place);
-  CaptureSink& capture = *inner;
   EXPECT_TRUE(DebugEnabled());
   Log(Level::Default, "Invalid request type: %@", Value("Bogus"));
   Log(Level::Info, "info %d", 1);
@@ -130,20 +128,18 @@ TEST(LogCapture, RecordsLevelsGatesDebugAndRestoresWhatWasBefore) {
                                       {Level::Info, "info 1"},
                                       {Level::Error, "fatal"},
                                       {Level::Debug, "debug on"}};
-  EXPECT_EQ(capture.Lines(), expected);
-  EXPECT_TRUE(capture.Contains(Level::Error, "fatal"));
-  EXPECT_FALSE(capture.Contains(Level::Default, "fatal"));
-  capture.Clear();
-  EXPECT_TRUE(capture.Texts().empty());
+  EXPECT_EQ(inner->Lines(), expected);
+  EXPECT_TRUE(inner->Contains(Level::Error, "fatal"));
+  EXPECT_FALSE(inner->Contains(Level::Default, "fatal"));
+  inner->Clear();
+  EXPECT_TRUE(inner->Texts().empty());
 
   inner.reset();
   EXPECT_FALSE(DebugEnabled());
   Log(Level::Default, "to outer");
   EXPECT_EQ(outer.Texts(), std::vector<std::string>{"to outer"});
-}
 
-TEST(LogCapture, AcceptsLinesFromOtherThreads) {
-  CaptureSink capture;
+  // Lines from other threads all arrive.
   std::vector<std::thread> threads;
   for (int t = 0; t < 4; ++t) {
     threads.emplace_back([t] {
@@ -151,50 +147,28 @@ TEST(LogCapture, AcceptsLinesFromOtherThreads) {
     });
   }
   for (auto& thread : threads) thread.join();
-  EXPECT_EQ(capture.Lines().size(), 1000u);
+  EXPECT_EQ(outer.Lines().size(), 1001u);
 }
 
-// Runs `body` with stderr redirected into a pipe and returns what it wrote.
-std::string CaptureStderr(const std::function<void()>& body) {
-  int fds[2];
-  EXPECT_EQ(pipe(fds), 0);
-  int saved = dup(STDERR_FILENO);
-  dup2(fds[1], STDERR_FILENO);
-  close(fds[1]);
-  body();
-  dup2(saved, STDERR_FILENO);
-  close(saved);
-  std::string out;
-  char buffer[256];
-  ssize_t n;
-  while ((n = read(fds[0], buffer, sizeof buffer)) > 0) out.append(buffer, n);
-  close(fds[0]);
-  return out;
-}
-
+// The stderr sink: plain level names on a terminal, syslog priorities for the journal.
 TEST(LogStderr, PrefixesForJournalAndTerminal) {
-  StderrSink sink;
   const char* previous = getenv("JOURNAL_STREAM");
-  std::string savedJournal = previous ? previous : "";
-
-  unsetenv("JOURNAL_STREAM");
-  EXPECT_EQ(CaptureStderr([&] {
-              sink.Write(Level::Default, "plain");
-              sink.Write(Level::Error, "bad");
-            }),
-            "default: plain\nerror: bad\n");
-
-  setenv("JOURNAL_STREAM", "8:1234", 1);
-  EXPECT_EQ(CaptureStderr([&] {
-              sink.Write(Level::Default, "a");
-              sink.Write(Level::Debug, "b");
-              sink.Write(Level::Info, "c");
-              sink.Write(Level::Error, "d");
-            }),
-            "<5>a\n<7>b\n<6>c\n<3>d\n");
-
-  if (previous) setenv("JOURNAL_STREAM", savedJournal.c_str(), 1);
-  else unsetenv("JOURNAL_STREAM");
+  const std::string savedJournal = previous ? previous : "";
+  const struct {
+    const char* journal;
+    std::string expected;
+  } cases[] = {{nullptr, "default: a\ndebug: b\ninfo: c\nerror: d\n"}, {"8:1234", "<5>a\n<7>b\n<6>c\n<3>d\n"}};
+  for (const auto& c : cases) {
+    c.journal ? setenv("JOURNAL_STREAM", c.journal, 1) : unsetenv("JOURNAL_STREAM");
+    StderrSink sink;
+    ::testing::internal::CaptureStderr();
+    for (const auto& [level, text] : {std::pair{Level::Default, "a"}, {Level::Debug, "b"}, {Level::Info, "c"},
+                                      {Level::Error, "d"}}) {
+      sink.Write(level, text);
+    }
+    EXPECT_EQ(::testing::internal::GetCapturedStderr(), c.expected);
+  }
+  previous ? setenv("JOURNAL_STREAM", savedJournal.c_str(), 1) : unsetenv("JOURNAL_STREAM");
 }
 
 }  // namespace

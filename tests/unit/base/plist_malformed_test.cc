@@ -1,6 +1,6 @@
-// Hostile documents: every one must be refused with an error text, quickly, without
-// crashing. Binary documents are assembled object by object so each test can say
-// exactly which structure is broken.
+// The property-list readers against hostile documents: every one must be refused with
+// an error text, quickly, without crashing. Binary documents are assembled object by
+// object so each test can say exactly which structure is broken.
 #include <gtest/gtest.h>
 
 #include <chrono>

@@ -34,7 +34,7 @@ TEST(RunLoop, PostedTasksRunInOrderFromAnyThread) {
   for (int i = 0; i < 1100; ++i) ASSERT_EQ(seen[i], i);
 }
 
-TEST(RunLoop, RunUntilChecksAfterEachTaskAndTimesOut) {
+TEST(RunLoop, RunUntilChecksAfterEachTaskAndTimesOutAndStopEndsRun) {
   RunLoop loop;
   int ran = 0;
   loop.Post([&] { ++ran; });
@@ -49,9 +49,26 @@ TEST(RunLoop, RunUntilChecksAfterEachTaskAndTimesOut) {
   auto elapsed = RunLoop::Clock::now() - start;
   EXPECT_GE(elapsed, 60ms);
   EXPECT_LT(elapsed, 1s);
+
+  // Stop ends Run before it starts, from another thread, and from a task.
+  loop.Stop();
+  loop.Run();  // returns at once
+
+  std::thread stopper([&] {
+    std::this_thread::sleep_for(20ms);
+    loop.Stop();
+  });
+  loop.Run();
+  stopper.join();
+
+  ran = 0;
+  loop.Post([&] { ++ran; loop.Stop(); });
+  loop.Post([&] { ++ran; });
+  loop.Run();
+  EXPECT_EQ(ran, 1);
 }
 
-TEST(RunLoop, SourceRemovedInsideACallbackIsNeverCalledAgain) {
+TEST(RunLoop, SourceRemovedInsideACallbackIsNeverCalledAgainAndSourcesMayShareAnFd) {
   RunLoop loop;
   Pipe a, b, self;
   a.Fill();
@@ -73,20 +90,17 @@ TEST(RunLoop, SourceRemovedInsideACallbackIsNeverCalledAgain) {
   loop.RunFor(30ms);
   EXPECT_EQ(calls, 1);
   EXPECT_EQ(selfCalls, 1);
-}
 
-TEST(RunLoop, TwoSourcesMayWatchOneFd) {
-  RunLoop loop;
-  Pipe pipe;
-  pipe.Fill();
-  int calls = 0;
-  SourceHandle one = loop.AddFd(pipe.read, EPOLLIN, [&](uint32_t) { ++calls; });
-  SourceHandle two = loop.AddFd(pipe.read, EPOLLIN, [&](uint32_t) { ++calls; });
+  // Two sources may watch one descriptor.
+  int bothCalls = 0;
+  SourceHandle one = loop.AddFd(a.read, EPOLLIN, [&](uint32_t) { ++bothCalls; });
+  SourceHandle two = loop.AddFd(a.read, EPOLLIN, [&](uint32_t) { ++bothCalls; });
   ASSERT_TRUE(one && two);
   EXPECT_EQ(loop.RunOnce(), 2);
+  EXPECT_EQ(bothCalls, 2);
 }
 
-TEST(RunLoop, TimersFireInDeadlineOrder) {
+TEST(RunLoop, TimersFireInDeadlineOrderAndRepeatUntilTheirHandleGoes) {
   RunLoop loop;
   std::string order;
   SourceHandle c = loop.AddTimer(60ms, [&] { order += 'c'; });
@@ -98,37 +112,15 @@ TEST(RunLoop, TimersFireInDeadlineOrder) {
   EXPECT_EQ(order, "abc");
   loop.RunFor(20ms);
   EXPECT_EQ(order, "abc");  // one-shot timers do not come back
-}
 
-TEST(RunLoop, RepeatingTimerRepeatsUntilItsHandleGoes) {
-  RunLoop loop;
   int ticks = 0;
-  SourceHandle timer;
-  timer = loop.AddRepeatingTimer(5ms, [&] {
-    if (++ticks == 4) timer.Reset();
+  SourceHandle repeating;
+  repeating = loop.AddRepeatingTimer(5ms, [&] {
+    if (++ticks == 4) repeating.Reset();
   });
   EXPECT_TRUE(loop.RunUntil([&] { return ticks == 4; }, 2s));
   loop.RunFor(30ms);
   EXPECT_EQ(ticks, 4);
-}
-
-TEST(RunLoop, StopEndsRunFromAnotherThreadAndBeforeRun) {
-  RunLoop loop;
-  loop.Stop();
-  loop.Run();  // returns at once
-
-  std::thread stopper([&] {
-    std::this_thread::sleep_for(20ms);
-    loop.Stop();
-  });
-  loop.Run();
-  stopper.join();
-
-  int ran = 0;
-  loop.Post([&] { ++ran; loop.Stop(); });
-  loop.Post([&] { ++ran; });
-  loop.Run();
-  EXPECT_EQ(ran, 1);
 }
 
 TEST(BackgroundQueue, RunsTasksByDeadlineAndPostsBack) {

@@ -20,6 +20,7 @@
 #include "platform/linux/os_tree_walk.h"
 #include "platform/services.h"
 #include "registry/registry_model.h"
+#include "test_files.h"
 
 namespace brisvale {
 namespace {
@@ -32,7 +33,6 @@ using ::testing::IsEmpty;
 class TreeOs : public testing::FakeOs {
  public:
   int Unlink(const char* path) override { return real.Unlink(path); }
-  int RemoveDirectory(const char* path) override { return real.RemoveDirectory(path); }
   os::DirectoryListing ReadDirectory(const char* path) override { return real.ReadDirectory(path); }
   int RealPath(const char* path, std::string& resolved) override { return real.RealPath(path, resolved); }
   int ClearFlags(const char* path) override { return real.ClearFlags(path); }
@@ -67,9 +67,6 @@ bool SetFlag(const fs::path& path, int flag) {
 class StaleMountPointsTest : public ::testing::Test {
  protected:
   StaleMountPointsTest() : services_(Services{&registry_, &os}) {
-    char dir[] = "/tmp/brisvale-stale-XXXXXX";
-    base = ::mkdtemp(dir);
-    root = base / "mnt";
     fs::create_directories(root);
     os.mounts = {{0, "proc", "/proc", "proc"}};  // nothing of the daemon's is mounted
   }
@@ -78,11 +75,11 @@ class StaleMountPointsTest : public ::testing::Test {
     for (const auto& entry : fs::recursive_directory_iterator(base, fs::directory_options::skip_permission_denied)) {
       if (!entry.is_symlink()) os.real.ClearFlags(entry.path().c_str());
     }
-    fs::remove_all(base);
   }
 
+  const brisvale::testing::ScratchDir scratch;
+  const fs::path base = scratch.path(), root = base / "mnt";
   TreeOs os;
-  fs::path base, root;
   log::CaptureSink capture;
 
  private:
@@ -139,7 +136,7 @@ TEST_F(StaleMountPointsTest, MissingRootIsSilentOtherFailuresAreLogged) {
 // swapped for a link to an outside one while the walk runs, a tree deeper than any path
 // may be long, and a start that is itself a link.
 TEST_F(StaleMountPointsTest, NothingOutsideTheRootIsTouched) {
-  if (::geteuid() != 0) GTEST_SKIP() << "needs root to bind mount";
+  BRISVALE_REQUIRE_ROOT();
   // On a memory file system of its own: deep trees are slow to create and drop on disk.
   ASSERT_EQ(::mount("tmpfs", base.c_str(), "tmpfs", 0, nullptr), 0);
   struct Unmount {

@@ -3,7 +3,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
+#include <map>
 
 #include "base/log.h"
 #include "daemon/request_handlers.h"
@@ -18,40 +20,31 @@ namespace {
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
 
+// Records each call; a call answers what `results` holds under its name, 0 by default.
 class RecordingOs : public testing::FakeOs {
  public:
-  int unmountResult = 0, rmdirResult = 0, openResult = 100, ejectResult = 0, syncResult = 0;
+  std::map<std::string, int> results;
   std::vector<std::string> calls;
 
-  int Unmount(const char* path, bool force) override {
-    calls.push_back(std::string(force ? "force-unmount " : "unmount ") + path);
-    return unmountResult;
+  int Record(const std::string& name, const char* path = nullptr) {
+    calls.push_back(path ? name + " " + path : name);
+    return results[name];
   }
-  int RemoveDirectory(const char* path) override {
-    calls.push_back(std::string("rmdir ") + path);
-    return rmdirResult;
-  }
+  int Unmount(const char* path, bool force) override { return Record(force ? "force-unmount" : "unmount", path); }
+  int RemoveDirectory(const char* path) override { return Record("rmdir", path); }
   int OpenDevice(const char* path) override {
-    calls.push_back(std::string("open ") + path);
-    // A real descriptor, since the caller owns and closes it.
-    return openResult < 0 ? openResult : ::dup(STDIN_FILENO);
+    const int rc = Record("open", path);
+    return rc < 0 ? rc : ::dup(STDIN_FILENO);  // a real descriptor, since the caller owns and closes it
   }
-  int EjectDevice(int) override {
-    calls.push_back("eject");
-    return ejectResult;
-  }
-  int mountedResult = 0, nodeNumber = 1;
-  int MountedDevice(const char*, uint64_t& device) override {
-    device = 1;
-    return mountedResult;
+  int EjectDevice(int) override { return Record("eject"); }
+  int SyncFilesystem(const char* path) override { return Record("sync", path); }
+  int MountedDevice(const char* path, uint64_t& device) override {
+    FakeOs::MountedDevice(path, device);
+    return results["mounted device"];
   }
   int DeviceNumber(int, uint64_t& device) override {
-    device = static_cast<uint64_t>(nodeNumber);
+    device = std::max(1, results["node device"]);
     return 0;
-  }
-  int SyncFilesystem(const char* path) override {
-    calls.push_back(std::string("sync ") + path);
-    return syncResult;
   }
 };
 
@@ -105,39 +98,35 @@ TEST_F(UnmountSyncTest, UnmountFailuresLogTheirLineAndLeaveTheRest) {
   struct Case {
     const char* name;
     plist::Dictionary request;
-    int RecordingOs::*knob;
-    int value;
+    const char* failing;  // the call that answers `result`
+    int result;
     std::string status;
     std::vector<std::string> lines;
     size_t calls;
     size_t posted;
   };
+  const plist::Dictionary media1{{"MountPath", "/private/var/mnt/media1"}};
   const Case cases[] = {
-      {"no path", {}, nullptr, 0, "Failure", {"Invalid value for MountPath: (null)"}, 0, 0},
-      {"path not text", {{"MountPath", plist::Value::Int(3)}}, nullptr, 0, "Failure",
+      {"no path", {}, "", 0, "Failure", {"Invalid value for MountPath: (null)"}, 0, 0},
+      {"path not text", {{"MountPath", plist::Value::Int(3)}}, "", 0, "Failure",
        {"Invalid value for MountPath: 3"}, 0, 0},
-      {"unknown path", {{"MountPath", "/private/var/mnt/other"}}, nullptr, 0, "Failure",
+      {"unknown path", {{"MountPath", "/private/var/mnt/other"}}, "", 0, "Failure",
        {"There is no matching entry in the device map for /private/var/mnt/other."}, 0, 0},
-      {"unmount refused", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::unmountResult, -EPERM,
-       "Failure", {"Failed to force unmount /private/var/mnt/media1: " + std::string(strerror(EPERM))}, 1, 0},
-      {"directory not empty", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::rmdirResult, -ENOTEMPTY,
-       "Failure", {"Failed to remove /private/var/mnt/media1: " + std::string(strerror(ENOTEMPTY))}, 2, 0},
-      {"open fails", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::openResult, -ENOENT, "Success",
-       {"Failed to open /dev/sdb1 : 2"}, 3, 1},
-      {"eject fails", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::ejectResult, -ENOTTY, "Success",
-       {"Failed to eject /dev/sdb1 : 25"}, 4, 1},
+      {"unmount refused", media1, "force-unmount", -EPERM, "Failure",
+       {"Failed to force unmount /private/var/mnt/media1: " + std::string(strerror(EPERM))}, 1, 0},
+      {"directory not empty", media1, "rmdir", -ENOTEMPTY, "Failure",
+       {"Failed to remove /private/var/mnt/media1: " + std::string(strerror(ENOTEMPTY))}, 2, 0},
+      {"open fails", media1, "open", -ENOENT, "Success", {"Failed to open /dev/sdb1 : 2"}, 3, 1},
+      {"eject fails", media1, "eject", -ENOTTY, "Success", {"Failed to eject /dev/sdb1 : 25"}, 4, 1},
       // The mount table's source names a device that does not hold the file system.
-      {"node is another device", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::nodeNumber, 2,
-       "Success", {"Failed to eject /dev/sdb1 : 19"}, 3, 1},
-      {"no device holds the mount", {{"MountPath", "/private/var/mnt/media1"}}, &RecordingOs::mountedResult,
-       -ENODEV, "Success", {"Failed to eject /dev/sdb1 : 19"}, 2, 1},
+      {"node is another device", media1, "node device", 2, "Success", {"Failed to eject /dev/sdb1 : 19"}, 3, 1},
+      {"no device holds the mount", media1, "mounted device", -ENODEV, "Success",
+       {"Failed to eject /dev/sdb1 : 19"}, 2, 1},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
-    RecordingOs fresh;
-    fresh.mounts = os.mounts;
-    if (c.knob) fresh.*c.knob = c.value;
-    os = fresh;
+    os.results = {{c.failing, c.result}};
+    os.calls.clear();
     center.posted.clear();
     capture.Clear();
     EXPECT_EQ(Run(HandleUnmount, c.request), c.status);
@@ -161,7 +150,7 @@ TEST_F(UnmountSyncTest, SyncHasItsOwnLines) {
     EXPECT_EQ(Run(HandleSync, request), "Failure");
     EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre(line));
   }
-  os.syncResult = -EIO;
+  os.results["sync"] = -EIO;
   capture.Clear();
   EXPECT_EQ(Run(HandleSync, {{"MountPath", "/private/var/mnt/media1"}}), "Failure");
   EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre("Failed to force the sync /private/var/mnt/media1: 5"));

@@ -1,0 +1,280 @@
+// The property-list value type (kinds, equality, dictionary order, descriptions) and
+// both formats: round trips over values chosen to hit the encodings' edges (integer
+// widths, length headers, string encodings, base64 padding, reference widths), and
+// agreement with an independent reader and writer, python3's plistlib.
+#include <gtest/gtest.h>
+
+#include <cmath>
+#include <cstdint>
+#include <cstdlib>
+#include <fstream>
+#include <limits>
+
+#include "base/plist.h"
+#include "plist_test_util.h"
+#include "test_files.h"
+
+namespace brisvale::plist {
+namespace {
+
+TEST(PlistValue, DescriptionOfEachKind) {
+  const struct {
+    Value value;
+    const char* text;
+  } cases[] = {
+      {Value("plain text"), "plain text"},
+      {Value::Int(-42), "-42"},
+      {Value::Int(std::numeric_limits<int64_t>::min()), "-9223372036854775808"},
+      {Value::UInt(std::numeric_limits<uint64_t>::max()), "18446744073709551615"},
+      {Value::Bool(true), "true"},
+      {Value::Bool(false), "false"},
+      {Value(Bytes{0x0a, 0x1b, 0xff}), "<0a1bff>"},
+      {Value(Bytes{}), "<>"},
+      {Value::Real(0.5), "0.5"},
+      {Value(Date{418863330}), "2014-04-10T22:55:30Z"},
+      {Value(Date{-0.5}), "2000-12-31T23:59:59Z"},  // floored, not rounded toward zero
+      {Value(Array{}), "[]"},
+      {Value(Array{Value("a"), Value::Int(1)}), "[a, 1]"},
+      {Value(Dictionary{{"Key", Value("value")}, {"Key2", Value(Array{Value::Bool(true)})}}),
+       "{Key: value, Key2: [true]}"},
+      {Value(), "{}"},
+  };
+  for (const auto& c : cases) EXPECT_EQ(c.value.description(), c.text);
+  EXPECT_EQ(Describe(nullptr), "(null)");
+  Value text("x");
+  EXPECT_EQ(Describe(&text), "x");
+}
+
+TEST(PlistValue, EqualityIsByValue) {
+  const Value ab(Dictionary{{"a", Value::Int(1)}, {"b", Value("2")}});
+  const Value ba(Dictionary{{"b", Value("2")}, {"a", Value::Int(1)}});
+  EXPECT_EQ(ab, ba);
+  EXPECT_NE(ab, Value(Dictionary{{"a", Value::Int(1)}, {"c", Value("2")}}));
+  EXPECT_NE(ab, Value(Dictionary{{"a", Value::Int(1)}}));
+  // Same numbers in different kinds are different values.
+  EXPECT_NE(Value::Int(1), Value::Real(1));
+  EXPECT_NE(Value::Int(1), Value::Bool(true));
+  EXPECT_NE(Value("ab"), Value(Bytes{'a', 'b'}));
+  // An unsigned integer that fits in int64 is the same value as the signed one.
+  EXPECT_EQ(Value::UInt(7), Value::Int(7));
+  EXPECT_EQ(Value(Integer{7, true}), Value::Int(7));
+  EXPECT_FALSE(Value::UInt(7).integer()->isUnsigned);
+  EXPECT_TRUE(Value::UInt(uint64_t{1} << 63).integer()->isUnsigned);
+}
+
+TEST(PlistValue, DictionaryKeepsOrderAndReplacesInPlace) {
+  Dictionary d{{"z", Value::Int(1)}, {"a", Value::Int(2)}};
+  d.set("z", Value::Int(3));
+  d.set("m", Value::Int(4));
+  std::string order;
+  for (const auto& [key, value] : d) order += key + value.description();
+  EXPECT_EQ(order, "z3a2m4");
+  EXPECT_TRUE(d.erase("a"));
+  EXPECT_FALSE(d.erase("a"));
+  EXPECT_EQ(d.size(), 2u);
+}
+
+TEST(PlistValue, CopiesAreIndependentOfTheShared) {
+  const Value original(Dictionary{{"Status", Value("Failure")}});
+  Dictionary changed = *original.dictionary();
+  changed.set("Status", Value("Success"));
+  const Value updated(std::move(changed));
+  EXPECT_EQ(*original.getString("Status"), "Failure");
+  EXPECT_EQ(*updated.getString("Status"), "Success");
+  EXPECT_EQ(original.getString("Missing"), nullptr);
+  EXPECT_EQ(Value::Int(1).get("Status"), nullptr);
+}
+
+TEST(PlistValue, FromEntriesRefusesDuplicateKeys) {
+  std::vector<Dictionary::Entry> small{{"a", Value::Int(1)}, {"a", Value::Int(2)}};
+  EXPECT_FALSE(Dictionary::FromEntries(small));
+  std::vector<Dictionary::Entry> large;
+  for (int i = 0; i < 100; ++i) large.emplace_back("k" + std::to_string(i), Value::Int(i));
+  EXPECT_TRUE(Dictionary::FromEntries(large));
+  large.emplace_back("k57", Value::Int(0));
+  EXPECT_FALSE(Dictionary::FromEntries(large));
+}
+
+Value Ints() {
+  Array a;
+  for (int64_t n : {int64_t{0}, int64_t{1}, int64_t{127}, int64_t{128}, int64_t{255},
+                    int64_t{256}, int64_t{32767}, int64_t{65535}, int64_t{65536},
+                    int64_t{2147483647}, int64_t{4294967295}, int64_t{4294967296},
+                    std::numeric_limits<int64_t>::max(), int64_t{-1}, int64_t{-128},
+                    int64_t{-129}, int64_t{-32768}, int64_t{-32769}, int64_t{-2147483648},
+                    int64_t{-2147483649}, std::numeric_limits<int64_t>::min()}) {
+    a.push_back(Value::Int(n));
+  }
+  a.push_back(Value::UInt(uint64_t{1} << 63));
+  a.push_back(Value::UInt(std::numeric_limits<uint64_t>::max()));
+  return Value(std::move(a));
+}
+
+Value Strings() {
+  return Value(Array{Value(""), Value("fourteen chars"), Value("fifteen chars.."),
+                     Value(std::string(300, 'x')), Value("h\xC3\xA9llo"),
+                     Value("\xF0\x9F\x98\x80 outside the BMP"), Value("<&>\"' ]]>"),
+                     Value("tab\tline\ncr\r")});
+}
+
+Value DataAndNumbers() {
+  Bytes big(300);
+  for (size_t i = 0; i < big.size(); ++i) big[i] = static_cast<uint8_t>(i * 7);
+  return Value(Array{Value(Bytes{}), Value(Bytes{1}), Value(Bytes{1, 2}), Value(Bytes{1, 2, 3}),
+                     Value(std::move(big)), Value::Real(0.1), Value::Real(-1e300),
+                     Value::Real(5e-324), Value::Real(std::numeric_limits<double>::infinity()),
+                     Value::Bool(true), Value::Bool(false), Value(Date{418863330}),
+                     Value(Date{-3e9})});
+}
+
+Value Containers() {
+  Dictionary wide;
+  Array long_array;
+  for (int i = 0; i < 20; ++i) {
+    wide.set("key" + std::to_string(i), Value("repeated"));
+    long_array.push_back(Value::Int(i));
+  }
+  return Value(Dictionary{
+      {"EmptyArray", Value(Array{})},
+      {"EmptyDict", Value(Dictionary{})},
+      {"Wide", Value(std::move(wide))},
+      {"Long", Value(std::move(long_array))},
+      {"Nested", Value(Array{Value(Array{Value(Dictionary{{"deep", Value(Array{})}})})})},
+  });
+}
+
+// Past 65,536 objects, references and offsets need four bytes.
+Value Large() {
+  Array a;
+  for (int i = 0; i < 70000; ++i) a.push_back(Value::Int(i % 3 == 0 ? i : -i));
+  return Value(std::move(a));
+}
+
+TEST(PlistCodec, RoundTripsThroughBothFormats) {
+  const Value values[] = {Ints(), Strings(), DataAndNumbers(), Containers(), Large(),
+                          Value("top-level string"), Value::Int(5), Value(Array{})};
+  for (const Value& value : values) {
+    SCOPED_TRACE(value.description().substr(0, 200));
+    std::string error;
+    const Bytes binary = WriteBinary(value);
+    EXPECT_EQ(ReadBinary(binary, &error), value) << error;
+    const std::string xml = WriteXml(value);
+    const std::span<const uint8_t> xmlBytes = AsBytes(xml);
+    EXPECT_EQ(ReadXml(xmlBytes, &error), value) << error;
+
+    Format format;
+    EXPECT_EQ(Read(binary, nullptr, &format), value);
+    EXPECT_EQ(format, Format::Binary);
+    EXPECT_EQ(Read(xmlBytes, nullptr, &format), value);
+    EXPECT_EQ(format, Format::Xml);
+  }
+}
+
+TEST(PlistCodec, DatesKeepFractionsInBinaryAndWholeSecondsInXml) {
+  const Value date(Date{418863330.75});
+  EXPECT_EQ(ReadBinary(WriteBinary(date)), date);
+  const std::string xml = WriteXml(date);
+  EXPECT_NE(xml.find("<date>2014-04-10T22:55:30Z</date>"), std::string::npos);
+  auto read = ReadXml(AsBytes(xml));
+  ASSERT_TRUE(read);
+  EXPECT_EQ(read->date()->secondsSinceReferenceDate, 418863330);
+}
+
+TEST(PlistCodec, NotANumberSurvivesAsNotANumber) {
+  const Value nan = Value::Real(std::numeric_limits<double>::quiet_NaN());
+  const std::string xml = WriteXml(nan);
+  for (const std::optional<Value>& read :
+       {ReadBinary(WriteBinary(nan)),
+        ReadXml(AsBytes(xml))}) {
+    ASSERT_TRUE(read && read->real());
+    EXPECT_TRUE(std::isnan(*read->real()));
+  }
+}
+
+TEST(PlistCodec, XmlWriterKeepsTheDocumentReadable) {
+  // Characters XML 1.0 cannot carry and broken UTF-8 become U+FFFD instead of
+  // producing a document no reader accepts.
+  const std::string xml = WriteXml(Value(std::string("a\x01" "b\xFF" "c")));
+  auto read = ReadXml(AsBytes(xml));
+  ASSERT_TRUE(read);
+  EXPECT_EQ(*read->string(), "a\xEF\xBF\xBD" "b\xEF\xBF\xBD" "c");
+}
+
+TEST(PlistCodec, BinaryWriterSharesEqualStrings) {
+  Array entries;
+  for (int i = 0; i < 100; ++i) {
+    entries.push_back(Value(Dictionary{{"DeviceType", Value("DiskImage")}}));
+  }
+  // The array, 100 dictionaries, one key and one value.
+  const Bytes binary = WriteBinary(Value(std::move(entries)));
+  EXPECT_EQ(binary[binary.size() - 17], 103);
+}
+
+// The same document as Expected() below, built on the Python side; the integers are those of Ints().
+constexpr const char kScript[] = R"PY(
+import datetime, plistlib, sys
+d = sys.argv[1]
+expected = {
+    "Status": "Success",
+    "Text": "h\u00e9llo \U0001F600 <&>",
+    "Empty": "",
+    "Ints": [0, 1, 127, 128, 255, 256, 32767, 65535, 65536, 2**31 - 1, 2**32 - 1, 2**32, 2**63 - 1,
+             -1, -128, -129, -32768, -32769, -2**31, -2**31 - 1, -2**63, 2**63, 2**64 - 1],
+    "Real": 0.1,
+    "Flags": [True, False],
+    "Data": bytes(range(40)),
+    "When": datetime.datetime(2014, 4, 10, 22, 55, 30),
+    "Nested": {"A": [], "D": {}, "L": [{"k": "v"}] * 20},
+}
+for name, fmt in (("ours.bplist", plistlib.FMT_BINARY), ("ours.xml", plistlib.FMT_XML)):
+    with open(f"{d}/{name}", "rb") as f:
+        got = plistlib.load(f, fmt=fmt)
+    if got != expected:
+        print(name, "differs:", got, file=sys.stderr)
+        sys.exit(1)
+with open(f"{d}/theirs.bplist", "wb") as f:
+    plistlib.dump(expected, f, fmt=plistlib.FMT_BINARY)
+with open(f"{d}/theirs.xml", "wb") as f:
+    plistlib.dump(expected, f, fmt=plistlib.FMT_XML)
+)PY";
+
+Value Expected() {
+  Bytes data(40);
+  for (size_t i = 0; i < data.size(); ++i) data[i] = static_cast<uint8_t>(i);
+  Array list(20, Value(Dictionary{{"k", Value("v")}}));
+  return Value(Dictionary{
+      {"Status", Value("Success")},
+      {"Text", Value("h\xC3\xA9llo \xF0\x9F\x98\x80 <&>")},
+      {"Empty", Value("")},
+      {"Ints", Ints()},
+      {"Real", Value::Real(0.1)},
+      {"Flags", Value(Array{Value::Bool(true), Value::Bool(false)})},
+      {"Data", Value(std::move(data))},
+      {"When", Value(Date{418863330})},
+      {"Nested", Value(Dictionary{{"A", Value(Array{})},
+                                  {"D", Value(Dictionary{})},
+                                  {"L", Value(std::move(list))}})},
+  });
+}
+
+TEST(PlistInterop, Python3PlistlibAgreesBothWays) {
+  if (std::system("python3 -c 'import plistlib' >/dev/null 2>&1") != 0) {
+    GTEST_SKIP() << "python3 with plistlib is not available";
+  }
+  const brisvale::testing::ScratchDir dir;
+  const Value expected = Expected();
+  brisvale::testing::WriteFileBytes(dir / "ours.bplist", WriteBinary(expected));
+  const std::string xml = WriteXml(expected);
+  brisvale::testing::WriteFileBytes(dir / "ours.xml", Bytes(xml.begin(), xml.end()));
+  std::ofstream(dir / "check.py") << kScript;
+  const std::string command = "python3 " + (dir / "check.py").string() + " " + dir.str();
+  EXPECT_EQ(std::system(command.c_str()), 0) << "plistlib could not read what we wrote";
+
+  for (const char* name : {"theirs.bplist", "theirs.xml"}) {
+    std::string error;
+    EXPECT_EQ(Read(brisvale::testing::ReadFileBytes(dir / name), &error), expected) << name << ": " << error;
+  }
+}
+
+}  // namespace
+}  // namespace brisvale::plist
