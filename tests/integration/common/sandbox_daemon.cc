@@ -10,8 +10,11 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <filesystem>
 #include <fstream>
 #include <thread>
+
+#include "platform/linux/os_sandbox.h"
 
 namespace brisvale::testing {
 namespace {
@@ -20,10 +23,8 @@ constexpr const char* kServiceName = "com.vantrel.brisvale_mounter.vexa";
 constexpr const char* kHardwareEventStream = "com.vantrel.kestrix.matching";
 
 bool WaitForExit(pid_t pid, std::chrono::milliseconds timeout) {
-  auto deadline = std::chrono::steady_clock::now() + timeout;
-  while (std::chrono::steady_clock::now() < deadline) {
-    int status;
-    pid_t done = waitpid(pid, &status, WNOHANG);
+  for (auto deadline = std::chrono::steady_clock::now() + timeout; std::chrono::steady_clock::now() < deadline;) {
+    const pid_t done = waitpid(pid, nullptr, WNOHANG);
     if (done == pid || (done < 0 && errno == ECHILD)) return true;
     std::this_thread::sleep_for(std::chrono::milliseconds(5));
   }
@@ -32,18 +33,13 @@ bool WaitForExit(pid_t pid, std::chrono::milliseconds timeout) {
 
 }  // namespace
 
-SandboxDaemon::SandboxDaemon() {
-  char pattern[] = "/tmp/brisvale-test.XXXXXX";
-  if (mkdtemp(pattern)) root_ = pattern;
-  logPath_ = root_ + ".log";
-}
-
 SandboxDaemon::~SandboxDaemon() {
   Stop();
-  if (!root_.empty()) {
-    std::string output;
-    int status = RunProgram({BRISVALE_DAEMON_PATH, "--root", root_, "--teardown"}, &output);
-    if (status != 0) ADD_FAILURE() << "teardown of " << root_ << " failed: " << output;
+  // The daemon's own teardown, so that the scratch directory holds no mounts when it goes.
+  std::string output;
+  if (std::filesystem::exists(Path(std::string("/") + linux_os::kSandboxMarker)) &&
+      RunProgram({BRISVALE_DAEMON_PATH, "--root", root_, "--teardown"}, &output) != 0) {
+    ADD_FAILURE() << "teardown of " << root_ << " failed: " << output;
   }
   unlink(logPath_.c_str());
 }
@@ -55,7 +51,7 @@ std::string SandboxDaemon::ServiceSocket() const {
 std::string SandboxDaemon::EventsSocket() const { return Path("/private/var/run/vexa/events"); }
 
 bool SandboxDaemon::Start(const std::vector<std::string>& extraArguments, int listenFd) {
-  if (root_.empty() || pid_ > 0) return false;
+  if (pid_ > 0) return false;
   std::vector<std::string> arguments = {BRISVALE_DAEMON_PATH, "--root", root_, "--verbose"};
   arguments.insert(arguments.end(), extraArguments.begin(), extraArguments.end());
   pid_ = fork();
@@ -96,7 +92,7 @@ void SandboxDaemon::Stop() {
   kill(pid_, SIGTERM);
   if (!WaitForExit(pid_, std::chrono::seconds(5))) {
     kill(pid_, SIGKILL);
-    WaitForExit(pid_, std::chrono::seconds(5));
+    waitpid(pid_, nullptr, 0);
   }
   pid_ = -1;
 }

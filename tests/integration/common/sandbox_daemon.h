@@ -19,8 +19,8 @@ namespace brisvale::testing {
 
 class SandboxDaemon {
  public:
-  // Makes an empty sandbox directory; Start() runs the daemon in it.
-  SandboxDaemon();
+  // The sandbox directory starts empty; Start() runs the daemon in it.
+  SandboxDaemon() = default;
   ~SandboxDaemon();
   SandboxDaemon(const SandboxDaemon&) = delete;
   SandboxDaemon& operator=(const SandboxDaemon&) = delete;
@@ -54,8 +54,9 @@ class SandboxDaemon {
                       std::chrono::milliseconds timeout = std::chrono::seconds(5)) const;
 
  private:
-  std::string root_;
-  std::string logPath_;
+  const ScratchDir scratch_;
+  const std::string root_ = scratch_.str();
+  const std::string logPath_ = root_ + ".log";
   pid_t pid_ = -1;
 };
 
