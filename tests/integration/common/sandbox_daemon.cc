@@ -31,6 +31,14 @@ bool WaitForExit(pid_t pid, std::chrono::milliseconds timeout) {
   return false;
 }
 
+[[noreturn]] void Exec(const std::vector<std::string>& arguments) {
+  std::vector<char*> argv;
+  for (const std::string& argument : arguments) argv.push_back(const_cast<char*>(argument.c_str()));
+  argv.push_back(nullptr);
+  execv(argv[0], argv.data());
+  _exit(127);
+}
+
 }  // namespace
 
 SandboxDaemon::~SandboxDaemon() {
@@ -65,11 +73,7 @@ bool SandboxDaemon::Start(const std::vector<std::string>& extraArguments, int li
       setenv("LISTEN_FDS", "1", 1);
       setenv("LISTEN_PID", std::to_string(getpid()).c_str(), 1);
     }
-    std::vector<char*> argv;
-    for (std::string& argument : arguments) argv.push_back(argument.data());
-    argv.push_back(nullptr);
-    execv(argv[0], argv.data());
-    _exit(127);
+    Exec(arguments);
   }
   // Listening once a client can connect. A daemon given its listener by activation
   // binds only the events socket itself.
@@ -77,8 +81,7 @@ bool SandboxDaemon::Start(const std::vector<std::string>& extraArguments, int li
   auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
   while (std::chrono::steady_clock::now() < deadline) {
     if (ipc::Client::Connect(readySocket)) return true;
-    int status;
-    if (waitpid(pid_, &status, WNOHANG) == pid_) {
+    if (waitpid(pid_, nullptr, WNOHANG) == pid_) {  // exited before it listened
       pid_ = -1;
       return false;
     }
@@ -132,8 +135,7 @@ std::vector<std::string> SandboxDaemon::LogLines() const {
 }
 
 bool SandboxDaemon::LogContains(const std::string& line) const {
-  std::vector<std::string> lines = LogLines();
-  return std::find(lines.begin(), lines.end(), line) != lines.end();
+  return std::ranges::count(LogLines(), line) > 0;
 }
 
 bool SandboxDaemon::WaitForLogLine(const std::string& line,
@@ -154,11 +156,7 @@ int RunProgram(const std::vector<std::string>& argv, std::string* output) {
   if (pid == 0) {
     dup2(pipeFds[1], STDOUT_FILENO);
     dup2(pipeFds[1], STDERR_FILENO);
-    std::vector<char*> args;
-    for (const std::string& arg : argv) args.push_back(const_cast<char*>(arg.c_str()));
-    args.push_back(nullptr);
-    execv(args[0], args.data());
-    _exit(127);
+    Exec(argv);
   }
   close(pipeFds[1]);
   std::string text;
