@@ -10,7 +10,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <climits>
 #include <filesystem>
 #include <fstream>
 #include <functional>
@@ -79,7 +78,6 @@ TEST_F(SandboxRoot, ChildSeesAWorkingDeviceLikeRootAndRestartsReuseTheBinds) {
     std::string failed = Enter(dir_);
     if (!failed.empty()) return failed;
     std::string error;
-    char resolved[PATH_MAX];
     const UniqueFd null(open("/dev/null", O_WRONLY)), zero(open("/dev/zero", O_RDONLY));
     if (!null || write(null.get(), "x", 1) != 1) return std::string("/dev/null unusable");
     unsigned char zeros[4] = {1, 1, 1, 1};
@@ -87,8 +85,7 @@ TEST_F(SandboxRoot, ChildSeesAWorkingDeviceLikeRootAndRestartsReuseTheBinds) {
     for (const char* path : {"/proc/self/exe", "/sys/block", "/bin/sh"}) {
       if (access(path, X_OK) != 0) return std::string("no ") + path;
     }
-    if (!realpath("/var", resolved) || std::string(resolved) != "/private/var") return std::string("/var");
-    if (!CheckFilesystemLayout(&error)) return "layout: " + error;
+    if (!CheckFilesystemLayout(&error)) return "layout: " + error;  // /var is the link to /private/var
     if (!fs::is_directory("/var/run/vexa")) return std::string("no /var/run/vexa");
     if (mkdir("/usr/brisvale-probe", 0755) == 0 || errno != EROFS) return std::string("/usr writable");
     return std::string();
