@@ -1,5 +1,5 @@
 // "Unmount" and "Sync" against real loop-mounted images in a sandbox root. (Unknown
-// paths and the failure lines are the handlers' unit test.)
+// paths are the handlers' unit test.)
 #include <fcntl.h>
 #include <sys/mount.h>
 #include <unistd.h>
