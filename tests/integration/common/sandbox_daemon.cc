@@ -159,14 +159,19 @@ int RunProgram(const std::vector<std::string>& argv, std::string* output) {
     Exec(argv);
   }
   close(pipeFds[1]);
-  std::string text;
-  char buffer[4096];
-  for (ssize_t n; (n = read(pipeFds[0], buffer, sizeof buffer)) > 0;) text.append(buffer, n);
+  std::string text = ReadUntilEnd(pipeFds[0]);
   close(pipeFds[0]);
   int status;
   waitpid(pid, &status, 0);
   if (output) *output = text;
   return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+std::string ReadUntilEnd(int fd) {
+  std::string text;
+  char buffer[4096];
+  for (ssize_t n; (n = read(fd, buffer, sizeof buffer)) > 0;) text.append(buffer, n);
+  return text;
 }
 
 }  // namespace brisvale::testing

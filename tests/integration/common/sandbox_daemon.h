@@ -64,6 +64,9 @@ class SandboxDaemon {
 // what it printed on stdout.
 int RunProgram(const std::vector<std::string>& argv, std::string* output = nullptr);
 
+// Everything read from `fd` until every writer has closed it.
+std::string ReadUntilEnd(int fd);
+
 // One object of a `--devices` file: its class, properties and children.
 inline plist::Value DeviceObject(std::string name, std::string className, plist::Dictionary properties,
                                  plist::Array children = {}) {

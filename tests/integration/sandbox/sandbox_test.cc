@@ -18,6 +18,7 @@
 #include "loop_mount.h"
 #include "platform/linux/loop_device.h"
 #include "platform/linux/os_system.h"
+#include "sandbox_daemon.h"
 #include "test_files.h"
 
 namespace brisvale::linux_os {
@@ -46,9 +47,7 @@ std::string InChild(const std::function<std::string()>& body) {
     _exit(write(fds[1], report.data(), report.size()) == static_cast<ssize_t>(report.size()) ? 0 : 1);
   }
   close(fds[1]);
-  std::string report;
-  char buffer[512];
-  for (ssize_t n; (n = read(fds[0], buffer, sizeof buffer)) > 0;) report.append(buffer, n);
+  const std::string report = brisvale::testing::ReadUntilEnd(fds[0]);
   close(fds[0]);
   waitpid(pid, nullptr, 0);
   return report;
