@@ -1,3 +1,4 @@
+// Removable media in a sandbox root: installing the tool doubles and placing simulated volumes.
 #include "media_doubles.h"
 
 #include <filesystem>

@@ -10,8 +10,11 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <filesystem>
 #include <fstream>
 #include <thread>
+
+#include "platform/linux/os_sandbox.h"
 
 namespace brisvale::testing {
 namespace {
@@ -20,30 +23,31 @@ constexpr const char* kServiceName = "com.vantrel.brisvale_mounter.vexa";
 constexpr const char* kHardwareEventStream = "com.vantrel.kestrix.matching";
 
 bool WaitForExit(pid_t pid, std::chrono::milliseconds timeout) {
-  auto deadline = std::chrono::steady_clock::now() + timeout;
-  while (std::chrono::steady_clock::now() < deadline) {
-    int status;
-    pid_t done = waitpid(pid, &status, WNOHANG);
+  for (auto deadline = std::chrono::steady_clock::now() + timeout; std::chrono::steady_clock::now() < deadline;) {
+    const pid_t done = waitpid(pid, nullptr, WNOHANG);
     if (done == pid || (done < 0 && errno == ECHILD)) return true;
     std::this_thread::sleep_for(std::chrono::milliseconds(5));
   }
   return false;
 }
 
-}  // namespace
-
-SandboxDaemon::SandboxDaemon() {
-  char pattern[] = "/tmp/brisvale-test.XXXXXX";
-  if (mkdtemp(pattern)) root_ = pattern;
-  logPath_ = root_ + ".log";
+[[noreturn]] void Exec(const std::vector<std::string>& arguments) {
+  std::vector<char*> argv;
+  for (const std::string& argument : arguments) argv.push_back(const_cast<char*>(argument.c_str()));
+  argv.push_back(nullptr);
+  execv(argv[0], argv.data());
+  _exit(127);
 }
+
+}  // namespace
 
 SandboxDaemon::~SandboxDaemon() {
   Stop();
-  if (!root_.empty()) {
-    std::string output;
-    int status = RunProgram({BRISVALE_DAEMON_PATH, "--root", root_, "--teardown"}, &output);
-    if (status != 0) ADD_FAILURE() << "teardown of " << root_ << " failed: " << output;
+  // The daemon's own teardown, so that the scratch directory holds no mounts when it goes.
+  std::string output;
+  if (std::filesystem::exists(Path(std::string("/") + linux_os::kSandboxMarker)) &&
+      RunProgram({BRISVALE_DAEMON_PATH, "--root", root_, "--teardown"}, &output) != 0) {
+    ADD_FAILURE() << "teardown of " << root_ << " failed: " << output;
   }
   unlink(logPath_.c_str());
 }
@@ -55,7 +59,7 @@ std::string SandboxDaemon::ServiceSocket() const {
 std::string SandboxDaemon::EventsSocket() const { return Path("/private/var/run/vexa/events"); }
 
 bool SandboxDaemon::Start(const std::vector<std::string>& extraArguments, int listenFd) {
-  if (root_.empty() || pid_ > 0) return false;
+  if (pid_ > 0) return false;
   std::vector<std::string> arguments = {BRISVALE_DAEMON_PATH, "--root", root_, "--verbose"};
   arguments.insert(arguments.end(), extraArguments.begin(), extraArguments.end());
   pid_ = fork();
@@ -69,11 +73,7 @@ bool SandboxDaemon::Start(const std::vector<std::string>& extraArguments, int li
       setenv("LISTEN_FDS", "1", 1);
       setenv("LISTEN_PID", std::to_string(getpid()).c_str(), 1);
     }
-    std::vector<char*> argv;
-    for (std::string& argument : arguments) argv.push_back(argument.data());
-    argv.push_back(nullptr);
-    execv(argv[0], argv.data());
-    _exit(127);
+    Exec(arguments);
   }
   // Listening once a client can connect. A daemon given its listener by activation
   // binds only the events socket itself.
@@ -81,8 +81,7 @@ bool SandboxDaemon::Start(const std::vector<std::string>& extraArguments, int li
   auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
   while (std::chrono::steady_clock::now() < deadline) {
     if (ipc::Client::Connect(readySocket)) return true;
-    int status;
-    if (waitpid(pid_, &status, WNOHANG) == pid_) {
+    if (waitpid(pid_, nullptr, WNOHANG) == pid_) {  // exited before it listened
       pid_ = -1;
       return false;
     }
@@ -96,7 +95,7 @@ void SandboxDaemon::Stop() {
   kill(pid_, SIGTERM);
   if (!WaitForExit(pid_, std::chrono::seconds(5))) {
     kill(pid_, SIGKILL);
-    WaitForExit(pid_, std::chrono::seconds(5));
+    waitpid(pid_, nullptr, 0);
   }
   pid_ = -1;
 }
@@ -136,8 +135,7 @@ std::vector<std::string> SandboxDaemon::LogLines() const {
 }
 
 bool SandboxDaemon::LogContains(const std::string& line) const {
-  std::vector<std::string> lines = LogLines();
-  return std::find(lines.begin(), lines.end(), line) != lines.end();
+  return std::ranges::count(LogLines(), line) > 0;
 }
 
 bool SandboxDaemon::WaitForLogLine(const std::string& line,
@@ -158,21 +156,22 @@ int RunProgram(const std::vector<std::string>& argv, std::string* output) {
   if (pid == 0) {
     dup2(pipeFds[1], STDOUT_FILENO);
     dup2(pipeFds[1], STDERR_FILENO);
-    std::vector<char*> args;
-    for (const std::string& arg : argv) args.push_back(const_cast<char*>(arg.c_str()));
-    args.push_back(nullptr);
-    execv(args[0], args.data());
-    _exit(127);
+    Exec(argv);
   }
   close(pipeFds[1]);
-  std::string text;
-  char buffer[4096];
-  for (ssize_t n; (n = read(pipeFds[0], buffer, sizeof buffer)) > 0;) text.append(buffer, n);
+  std::string text = ReadUntilEnd(pipeFds[0]);
   close(pipeFds[0]);
   int status;
   waitpid(pid, &status, 0);
   if (output) *output = text;
   return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+std::string ReadUntilEnd(int fd) {
+  std::string text;
+  char buffer[4096];
+  for (ssize_t n; (n = read(fd, buffer, sizeof buffer)) > 0;) text.append(buffer, n);
+  return text;
 }
 
 }  // namespace brisvale::testing

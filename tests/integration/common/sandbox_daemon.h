@@ -19,8 +19,8 @@ namespace brisvale::testing {
 
 class SandboxDaemon {
  public:
-  // Makes an empty sandbox directory; Start() runs the daemon in it.
-  SandboxDaemon();
+  // The sandbox directory starts empty; Start() runs the daemon in it.
+  SandboxDaemon() = default;
   ~SandboxDaemon();
   SandboxDaemon(const SandboxDaemon&) = delete;
   SandboxDaemon& operator=(const SandboxDaemon&) = delete;
@@ -54,14 +54,18 @@ class SandboxDaemon {
                       std::chrono::milliseconds timeout = std::chrono::seconds(5)) const;
 
  private:
-  std::string root_;
-  std::string logPath_;
+  const ScratchDir scratch_;
+  const std::string root_ = scratch_.str();
+  const std::string logPath_ = root_ + ".log";
   pid_t pid_ = -1;
 };
 
 // Runs a program, waits for it, returns its exit status (-1 if it did not exit) and
 // what it printed on stdout.
 int RunProgram(const std::vector<std::string>& argv, std::string* output = nullptr);
+
+// Everything read from `fd` until every writer has closed it.
+std::string ReadUntilEnd(int fd);
 
 // One object of a `--devices` file: its class, properties and children.
 inline plist::Value DeviceObject(std::string name, std::string className, plist::Dictionary properties,

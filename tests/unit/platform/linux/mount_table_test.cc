@@ -13,10 +13,8 @@ namespace brisvale::os {
 namespace {
 
 TEST(MountTable, CountThenFillDecodesPathsAndReadsTheReadOnlyFlag) {
-  char name[] = "/tmp/brisvale-mountinfo-XXXXXX";
-  int fd = mkstemp(name);
-  ASSERT_GE(fd, 0);
-  close(fd);
+  const testing::ScratchDir scratch;
+  const std::string name = scratch.str() + "/mountinfo";
   std::ofstream(name)
       << "22 1 254:0 / / rw,relatime shared:1 - ext4 /dev/vda rw\n"
          "40 22 0:35 / /private/var/mnt/my\\040stick rw,nosuid - tmpfs tmp\\040fs rw\n"
@@ -25,9 +23,9 @@ TEST(MountTable, CountThenFillDecodesPathsAndReadsTheReadOnlyFlag) {
          "43 22 0:36 / /proc rw - proc none rw\n"
          "44 22 0:37 / /" << std::string(1100, 'd') << " rw - fuse.a-very-long-type-name src rw\n";
 
-  EXPECT_EQ(ReadMountTable(name, {}), 6);
+  EXPECT_EQ(ReadMountTable(name.c_str(), {}), 6);
   std::vector<MountRecord> records(7);
-  ASSERT_EQ(ReadMountTable(name, records), 6);
+  ASSERT_EQ(ReadMountTable(name.c_str(), records), 6);
   EXPECT_EQ(records[1], (MountRecord{0, "tmpfs", "/private/var/mnt/my stick", "tmp fs"}));
   EXPECT_EQ(records[2], (MountRecord{kMountReadOnly, "ext4", "/Developer", "/dev/loop3"}));
   // Read-only in the file system's own options counts too.
@@ -39,10 +37,9 @@ TEST(MountTable, CountThenFillDecodesPathsAndReadsTheReadOnlyFlag) {
 
   // A buffer smaller than the table takes the first records only.
   std::vector<MountRecord> two(2);
-  EXPECT_EQ(ReadMountTable(name, two), 2);
+  EXPECT_EQ(ReadMountTable(name.c_str(), two), 2);
   EXPECT_EQ(two[1].mountedOn, "/private/var/mnt/my stick");
-  unlink(name);
-  EXPECT_LT(ReadMountTable(name, {}), 0);
+  EXPECT_LT(ReadMountTable((scratch.str() + "/missing").c_str(), {}), 0);
 }
 
 // The fill reuses the count's table only while the kernel reports no change.
