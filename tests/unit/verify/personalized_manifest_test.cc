@@ -8,6 +8,7 @@
 #include <ostream>
 
 #include "base/log.h"
+#include "imgtool/options.h"
 #include "platform/device_properties.h"
 #include "test_support.h"
 #include "verify/image_digest.h"
@@ -34,17 +35,14 @@ struct Case {
 
 void PrintTo(const Case& c, std::ostream* os) { *os << c.name; }
 
-// The device's options with those of `overrides` replacing them, then the rest.
-Args Merge(const Args& device, const Args& overrides) {
-  Args merged = device;
-  for (size_t i = 0; i < overrides.size(); ++i) {
+// The device's options, each "--option value" pair of `overrides` replacing or added.
+Args Merge(Args merged, const Args& overrides) {
+  for (size_t i = 0; i + 1 < overrides.size(); i += 2) {
     auto found = std::find(merged.begin(), merged.end(), overrides[i]);
-    bool takesValue = i + 1 < overrides.size() && overrides[i + 1].rfind("--", 0) != 0;
-    if (found != merged.end() && takesValue) {
-      *(found + 1) = overrides[++i];
+    if (found != merged.end()) {
+      *(found + 1) = overrides[i + 1];
     } else {
-      merged.push_back(overrides[i]);
-      if (takesValue) merged.push_back(overrides[++i]);
+      merged.insert(merged.end(), {overrides[i], overrides[i + 1]});
     }
   }
   return merged;
@@ -59,7 +57,7 @@ class PersonalizedManifestTest : public ::testing::TestWithParam<Case> {
 TEST_P(PersonalizedManifestTest, ChecksDeviceAndImage) {
   const Case& c = GetParam();
   std::string image = (dir_ / "image").string();
-  testing::WriteBytes(image, testing::Bytes(70000, 0xA5));
+  testing::WriteFileBytes(image, testing::Bytes(70000, 0xA5));
 
   Args identity = {"identity", "-o", (dir_ / "identity.plist").string()};
   const Args& deviceValues = c.identity.empty() ? kDevice : c.identity;
@@ -76,41 +74,34 @@ TEST_P(PersonalizedManifestTest, ChecksDeviceAndImage) {
   std::vector<uint8_t> digest;
   ASSERT_EQ(DigestImageFile(image, &digest, c.digestLength), 0);
   log::CaptureSink capture;
-  EXPECT_EQ(VerifyPersonalizedManifest(testing::ReadBytes(dir_ / "manifest"), digest), c.result);
-  Lines lines = capture.Texts(Level::Default);
-  EXPECT_EQ(lines, c.lastLines);
+  EXPECT_EQ(VerifyPersonalizedManifest(testing::ReadFileBytes(dir_ / "manifest"), digest), c.result);
+  EXPECT_EQ(capture.Texts(Level::Default), c.lastLines);
 }
+
+// The two lines of a manifest tag that does not match the device or the image.
+Lines TagRefused(const std::string& tag) {
+  return {"Failed to validate manifest tag: " + tag, "Failed to evaluate trust: -1"};
+}
+
+const Args kDeviceWithoutNonce(kDevice.begin() + 2, kDevice.end());
+const Args kDeviceWithNumbers = [] { Args a = kDevice; a.push_back("--numbers"); return a; }();
 
 const Case kCases[] = {
     {"Sha384Matches", {}, {}, "sha384", 48, 0, {}},
     {"Sha1Matches", {"--chain", "sha1", "--dgst", "sha1"}, {}, "sha1", 20, 0, {}},
-    {"ModesAsIntegers", {}, {[] { Args a = kDevice; a.push_back("--numbers"); return a; }()},
-     "sha384", 48, 0, {}},
+    {"ModesAsIntegers", {}, kDeviceWithNumbers, "sha384", 48, 0, {}},
     {"UnknownTagAccepted", {"--property", "XXXX=int:7", "--object-property", "YYYY=str:z"}, {},
      "sha384", 48, 0, {}},
     {"PinnedValueHonoured", {"--leaf-constraint", "CHIP=int:0x8030"}, {}, "sha384", 48, 0, {}},
-    {"AnotherDevice", {"--ecid", "0x1122334455667789"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: ECID", "Failed to evaluate trust: -1"}},
-    {"EcidHighBitsCount", {"--ecid", "0x0000000055667788"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: ECID", "Failed to evaluate trust: -1"}},
-    {"OtherBoard", {"--board", "9"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: BORD", "Failed to evaluate trust: -1"}},
-    {"OtherImage", {"--dgst", "hex:" + std::string(96, '0')}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: DGST", "Failed to evaluate trust: -1"}},
-    {"DigestLengthDiffers", {"--dgst", "sha1"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: DGST", "Failed to evaluate trust: -1"}},
-    {"EkeyFalse", {"--ekey", "false"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: EKEY", "Failed to evaluate trust: -1"}},
-    {"SdomZero", {"--sdom", "0"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: SDOM", "Failed to evaluate trust: -1"}},
-    {"ProductionDiffers", {"--production", "false"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: CPRO", "Failed to evaluate trust: -1"}},
-    {"DeviceWithoutNonce",
-     {},
-     {"--board", "8", "--chip", "0x8030", "--ecid", "0x1122334455667788", "--production", "true",
-      "--security", "true"},
-     "sha384", 48, -1,
-     {"Failed to validate manifest tag: BNCH", "Failed to evaluate trust: -1"}},
+    {"AnotherDevice", {"--ecid", "0x1122334455667789"}, {}, "sha384", 48, -1, TagRefused("ECID")},
+    {"EcidHighBitsCount", {"--ecid", "0x0000000055667788"}, {}, "sha384", 48, -1, TagRefused("ECID")},
+    {"OtherBoard", {"--board", "9"}, {}, "sha384", 48, -1, TagRefused("BORD")},
+    {"OtherImage", {"--dgst", "hex:" + std::string(96, '0')}, {}, "sha384", 48, -1, TagRefused("DGST")},
+    {"DigestLengthDiffers", {"--dgst", "sha1"}, {}, "sha384", 48, -1, TagRefused("DGST")},
+    {"EkeyFalse", {"--ekey", "false"}, {}, "sha384", 48, -1, TagRefused("EKEY")},
+    {"SdomZero", {"--sdom", "0"}, {}, "sha384", 48, -1, TagRefused("SDOM")},
+    {"ProductionDiffers", {"--production", "false"}, {}, "sha384", 48, -1, TagRefused("CPRO")},
+    {"DeviceWithoutNonce", {}, kDeviceWithoutNonce, "sha384", 48, -1, TagRefused("BNCH")},
     // The leaf pins another chip: its constraint fails before any tag rule runs.
     {"PinnedValueBroken", {"--leaf-constraint", "CHIP=int:1"}, {}, "sha384", 48, -1,
      {"Failed to evaluate trust: -1"}},
@@ -123,8 +114,7 @@ const Case kCases[] = {
     {"UpperCaseSha1IsSha384", {}, {}, "SHA1", 48, 0, {}},
     {"Sha1MethodRefusesSha384Chain", {}, {}, "sha1", 48, -1, {"Failed to evaluate trust: -1"}},
     {"NoHashMethod", {}, {}, nullptr, 48, -1, {"Failed to retrieve Qor4CryptoHashMethod."}},
-    {"NoDiskImageObject", {"--object", "pdmX"}, {}, "sha384", 48, -1,
-     {"Failed to evaluate trust: 1"}},
+    {"NoDiskImageObject", {"--object", "pdmX"}, {}, "sha384", 48, -1, {"Failed to evaluate trust: 1"}},
 };
 
 INSTANTIATE_TEST_SUITE_P(Manifests, PersonalizedManifestTest, ::testing::ValuesIn(kCases),
@@ -147,7 +137,7 @@ TEST(VerifyPersonalizedManifest, UndecodableManifestFailsFirst) {
 }
 
 TEST(EvaluateManifestProperty, UnhandledTagIsOnlyADebugNote) {
-  testing::Bytes property = testing::FromHex("300916045858585802012a");  // SEQ { "XXXX", 42 }
+  testing::Bytes property = imgtool::ParseHex("300916045858585802012a", "property");  // SEQ { "XXXX", 42 }
   device::DeviceIdentity identity;
   ManifestCheckContext check{{}, &identity};
   log::CaptureSink capture;
