@@ -21,11 +21,7 @@ using testing::Pki;
 Bytes Der(const std::string& name) { return testing::ReadFileBytes(Pki(name)); }
 Bytes Hex(const std::string& hex) { return imgtool::ParseHex(hex, "test pattern"); }
 
-struct ChainResult {
-  int status;
-  Bytes publicKey;
-  Bytes constraints;
-};
+struct ChainResult { int status; Bytes publicKey, constraints; };
 
 ChainResult Verify(Qor4VerifyChainFunction verify, const Bytes& chain,
                    const Qor4SecureBootParams& params) {
@@ -105,12 +101,8 @@ TEST(ChainVerify, AcceptsOnlyWellFormedChainsOfTheSet) {
   };
   const Bytes generalMinted = Minted("general-intermediate", "general-leaf", EVP_sha1());
   const Bytes generalSha256 = Minted("general-intermediate", "general-leaf", EVP_sha256());
-  struct Case {
-    const char* name;
-    bool sha1;  // the SHA-1 set with its intermediate, else the one-certificate SHA-384 set
-    Bytes chain;
-    int result;
-  } cases[] = {
+  // `sha1`: the SHA-1 set with its intermediate, else the one-certificate SHA-384 set.
+  struct Case { const char* name; bool sha1; Bytes chain; int result; } cases[] = {
       {"intermediate and leaf", true, Concat({intermediate, leaf}), 0},
       {"leaf alone", true, leaf, -1},
       {"one leaf too many", true, Concat({intermediate, leaf, leaf}), -1},
@@ -173,11 +165,7 @@ TEST(ChainVerify, EcdsaChainUnderTheLocalRoot) {
 
 TEST(SignatureVerify, RsaModulusUpTo4096BitsAndTheSetsDigestLength) {
   const Bytes digest(48, 0x42);
-  struct Case {
-    const char* key;
-    const Qor4SecureBootParams* params;
-    int result;
-  } cases[] = {{"secure-leaf.key", &kQor4DecodeSecureBootRsa4kSha384, 0},
+  struct Case { const char* key; const Qor4SecureBootParams* params; int result; } cases[] = {{"secure-leaf.key", &kQor4DecodeSecureBootRsa4kSha384, 0},
                {"rsa-4104.key", &kQor4DecodeSecureBootRsa4kSha384, -1},
                {"secure-leaf.key", &kQor4DecodeSecureBootRsa1kSha1, -1}};
   for (const Case& c : cases) {

@@ -33,11 +33,7 @@ TEST(ContainerInit, SectionRules) {
   auto manifest = [](const char* magic, const Bytes& body) {
     return Sequence({IA5String(magic), Integer(0), body, OctetString(Bytes{1}), Sequence({})});
   };
-  const struct {
-    const char* name;
-    Bytes container;
-    int result;
-  } cases[] = {
+  const struct { const char* name; Bytes container; int result; } cases[] = {
       {"Valid", DefaultContainer(), DERResultSuccess},
       {"PayloadOnly", Container(payload, std::nullopt), DERResultSuccess},
       {"TrailingByte", WithTrailingByte(DefaultContainer()), DERResultOverflow},
@@ -154,11 +150,8 @@ TEST(ObjectProperty, ShapeRules) {
     return Constructed(PrivateConstructedTag(FourCC("DGST")), {inside});
   };
   const Bytes value = OctetString(Bytes{1});
-  const struct {
-    const char* name;
-    Bytes property;  // as stored in the "pdmg" object
-    int result;
-  } cases[] = {
+  // Each property as stored in the "pdmg" object.
+  const struct { const char* name; Bytes property; int result; } cases[] = {
       {"Valid", DataProperty("DGST", Bytes{1}), DERResultSuccess},
       {"NameDiffersFromTag", underDgst(Sequence({IA5String("DGSU"), value})), DERResultUnexpectedTag},
       {"ThirdElement", underDgst(Sequence({IA5String("DGST"), value, Null()})), DERResultUnexpectedTag},

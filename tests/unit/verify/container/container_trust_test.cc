@@ -169,11 +169,8 @@ TEST_F(TrustEvaluation, CertificateConstraints) {
   auto presence = [](const char* code, uint64_t optional) {
     return Property(code, Constructed(ContextTag(optional, true), {}));
   };
-  const struct {
-    const char* name;
-    Bytes constraints;  // the extension value
-    int result;
-  } cases[] = {
+  // Each row's constraints are the extension value.
+  const struct { const char* name; Bytes constraints; int result; } cases[] = {
       {"NoExtension", {}, DERResultDecodeError},
       {"EmptySet", Set({}), DERResultSuccess},
       {"NotASet", Sequence({}), DERResultUnexpectedTag},

@@ -141,11 +141,7 @@ const Bytes kC = {0x04, 0x02, 0xAA, 0xBB};
 const Bytes kD = {0x05, 0x00};
 
 TEST(DerTable, OptionalRequiredAndTrailingRules) {
-  const struct {
-    const char* name;
-    std::vector<Bytes> elements;
-    DERResult result;
-  } cases[] = {
+  const struct { const char* name; std::vector<Bytes> elements; DERResult result; } cases[] = {
       {"AC", {kA, kC}, DERResultSuccess},
       {"ABC", {kA, kB, kC}, DERResultSuccess},
       {"AB", {kA, kB}, DERResultIncompleteSequence},
@@ -245,11 +241,7 @@ TEST(DerInteger, ConvertsWithinItsWidth) {
 }
 
 TEST(DerBoolean, StrictContentAndDefault) {
-  const struct {
-    Bytes content;
-    DERResult result;
-    bool value;
-  } cases[] = {{{0xFF}, DERResultSuccess, true},
+  const struct { Bytes content; DERResult result; bool value; } cases[] = {{{0xFF}, DERResultSuccess, true},
                {{0x00}, DERResultSuccess, false},
                {{0x01}, DERResultDecodeError, false},
                {{}, DERResultDecodeError, false},
