@@ -21,18 +21,16 @@ using testing::Pki;
 Bytes Der(const std::string& name) { return testing::ReadFileBytes(Pki(name)); }
 Bytes Hex(const std::string& hex) { return imgtool::ParseHex(hex, "test pattern"); }
 
-struct ChainResult { int status; Bytes publicKey, constraints; };
+struct ChainResult { int status; Bytes publicKey; };
 
 ChainResult Verify(Qor4VerifyChainFunction verify, const Bytes& chain,
                    const Qor4SecureBootParams& params) {
   const uint8_t* key = nullptr;
-  uint32_t keyLength = 0;
   const uint8_t* constraints = nullptr;
-  uint32_t constraintsLength = 0;
+  uint32_t keyLength = 0, constraintsLength = 0;
   int status = verify(chain.data(), static_cast<uint32_t>(chain.size()), &key, &keyLength,
                       &constraints, &constraintsLength, &params, nullptr);
-  return {status, key ? Bytes(key, key + keyLength) : Bytes{},
-          constraints ? Bytes(constraints, constraints + constraintsLength) : Bytes{}};
+  return {status, key ? Bytes(key, key + keyLength) : Bytes{}};
 }
 
 Bytes RsaPublicKeyOf(const std::string& key) {
@@ -133,21 +131,6 @@ TEST(ChainVerify, AcceptsOnlyWellFormedChainsOfTheSet) {
               c.result)
         << c.name;
   }
-}
-
-TEST(ChainVerify, OutputsAreTheLeafKeyAndItsConstraints) {
-  ChainResult plain = Verify(verify_chain_qor4_v2, Der("secure-leaf.der"),
-                             kQor4DecodeSecureBootRsa4kSha384);
-  ASSERT_EQ(plain.status, 0);
-  EXPECT_EQ(plain.publicKey, RsaPublicKeyOf("secure-leaf.key"));
-  EXPECT_TRUE(plain.constraints.empty());
-
-  ChainResult constrained = Verify(verify_chain_qor4_v1,
-                                   Concat({Der("general-intermediate.der"),
-                                           Der("general-leaf-constrained.der")}),
-                                   kQor4DecodeSecureBootRsa1kSha1);
-  ASSERT_EQ(constrained.status, 0);
-  EXPECT_EQ(constrained.constraints, Hex("3111ff84ea859c500a300816044d414e503100"));
 }
 
 TEST(ChainVerify, EcdsaChainUnderTheLocalRoot) {

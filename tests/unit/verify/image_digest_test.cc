@@ -40,12 +40,7 @@ TEST(DigestImageFile, FailuresLogWhy) {
   testing::WriteFileBytes(dir / "image", {1, 2, 3});
   std::string image = (dir / "image").string();
   std::string missing = (dir / "missing").string();
-  struct Case {
-    std::string path;
-    long length;
-    bool withOutput;
-    std::vector<std::string> lines;
-  } cases[] = {
+  struct Case { std::string path; long length; bool withOutput; std::vector<std::string> lines; } cases[] = {
       {image, 32, true, {"Unsupported digest size: 32", "Failed to digest data."}},
       {image, 0, true, {"Unsupported digest size: 0", "Failed to digest data."}},
       {image, 20, false, {"Invalid input"}},

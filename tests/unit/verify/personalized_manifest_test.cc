@@ -103,18 +103,14 @@ TEST(VerifyPersonalizedManifest, ChecksDeviceAndImage) {
 }
 
 TEST(VerifyPersonalizedManifest, UndecodableManifestFailsFirst) {
-  std::vector<uint8_t> digest(48);
-  struct {
-    testing::Bytes bytes;
-    const char* line;
-  } cases[] = {
+  const std::pair<testing::Bytes, const char*> cases[] = {
       {{}, "Failed to initialize qor4 manifest: 6"},
       {{0x31, 0x00}, "Failed to initialize qor4 manifest: 2"},
   };
-  for (const auto& c : cases) {
+  for (const auto& [bytes, line] : cases) {
     log::CaptureSink capture;
-    EXPECT_EQ(VerifyPersonalizedManifest(c.bytes, digest), -1);
-    EXPECT_EQ(capture.Texts(), Lines{c.line});
+    EXPECT_EQ(VerifyPersonalizedManifest(bytes, std::vector<uint8_t>(48)), -1);
+    EXPECT_EQ(capture.Texts(), Lines{line});
   }
 }
 
