@@ -26,12 +26,9 @@ TEST(VerifyDeveloperImageSignature, TrustAtTheFixedInstantThenTheSignature) {
   const std::string missingCertificate = (dir / "no-cert.pem").string();
   const Lines untrusted = {"Failed to evaluate trust: 5",
                            "Failed to extract public key from the certificate."};
+  // `lines`: none when the signature is accepted.
   struct Case {
-    const char* key;
-    std::string certificate;
-    const char* image;
-    std::string ca;
-    Lines lines;  // none when the signature is accepted
+    const char* key; std::string certificate; const char* image; std::string ca; Lines lines;
   } cases[] = {
       {"developer-signing.key", certificate, "image", ca, {}},
       // Expired long after 2014-04-10: still trusted then.

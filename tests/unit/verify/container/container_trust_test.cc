@@ -96,14 +96,10 @@ TEST_F(TrustEvaluation, FirstFailureIsTheResult) {
   Qor4SecureBootParams noChain = kFakeParams, longDigest = kFakeParams;
   noChain.verifyChain = nullptr;
   longDigest.digestInfo = &kTooLong;
+  // `failingSlot` is made to answer 42; `stopWith` is the property callback's answer.
   const struct {
-    const char* name;
-    int SlotState::*failingSlot;  // made to answer 42
-    int stopWith;                 // the property callback's answer
-    uint32_t object;
-    const Qor4SecureBootParams* params;
-    int result, signatureCalls, certificateCalls;
-    size_t delivered;
+    const char* name; int SlotState::*failingSlot; int stopWith; uint32_t object;
+    const Qor4SecureBootParams* params; int result, signatureCalls, certificateCalls; size_t delivered;
   } cases[] = {
       {"digest", &SlotState::digestResult, 0, kPdmg, &kFakeParams, 42, 0, 0, 0},
       {"chain", &SlotState::chainResult, 0, kPdmg, &kFakeParams, 42, 0, 0, 0},

@@ -35,12 +35,7 @@ TEST(DerDecodeItem, ResultTagAndLength) {
   constexpr uint64_t kLargestTag = (uint64_t{1} << 61) - 1;
   const Bytes longPrefix = WithZeros({0x30, 0x82, 0x10, 0x00}, 10);
   struct Case {
-    const char* name;
-    Bytes input;
-    bool partial;
-    DERResult result;
-    DERTag tag = 0;
-    uint32_t length = 0;
+    const char* name; Bytes input; bool partial; DERResult result; DERTag tag = 0; uint32_t length = 0;
   } cases[] = {
       {"EmptySequence", {0x30, 0x00}, false, DERResultSuccess, DERTagSequence, 0},
       {"OneByte", {0x30}, false, DERResultDecodeError},
@@ -207,12 +202,9 @@ TEST(DerTable, ZeroRowsAndOuterElementRules) {
 }
 
 TEST(DerInteger, ConvertsWithinItsWidth) {
+  // `wide`: DERParseInteger64, else DERParseInteger.
   const struct {
-    const char* name;
-    Bytes content;
-    bool wide;  // DERParseInteger64, else DERParseInteger
-    DERResult result;
-    uint64_t value = 0;
+    const char* name; Bytes content; bool wide; DERResult result; uint64_t value = 0;
   } cases[] = {
       {"Zero", {0x00}, true, DERResultSuccess, 0},
       {"Empty", {}, true, DERResultDecodeError},
