@@ -16,7 +16,6 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <iterator>
 #include <memory>
 #include <string>
 #include <vector>
@@ -26,6 +25,7 @@
 #include "platform/device_properties.h"
 #include "platform/os.h"
 #include "platform/services.h"
+#include "test_files.h"
 #include "verify/image_digest.h"
 #include "verify/personalized_manifest.h"
 
@@ -38,25 +38,8 @@ const brisvale::ScopedServices systemOs(brisvale::Services{.os = &brisvale::os::
 using Bytes = std::vector<uint8_t>;
 
 // A temp directory for the run, removed at exit with everything in it.
-class Scratch {
- public:
-  Scratch() {
-    std::string pattern = (fs::temp_directory_path() / "brisvale-bench-XXXXXX").string();
-    if (!mkdtemp(pattern.data())) std::abort();
-    path_ = pattern;
-  }
-  ~Scratch() {
-    std::error_code ignored;
-    fs::remove_all(path_, ignored);
-  }
-  fs::path operator/(const std::string& name) const { return path_ / name; }
-
- private:
-  fs::path path_;
-};
-
-Scratch& TempDir() {
-  static Scratch scratch;
+brisvale::testing::ScratchDir& TempDir() {
+  static brisvale::testing::ScratchDir scratch;
   return scratch;
 }
 
@@ -120,11 +103,6 @@ BENCHMARK(BM_OpensslDgst)->Arg(20)->Arg(48)->Unit(benchmark::kMillisecond)->UseR
 
 // --- Personalized manifest -------------------------------------------------------------
 
-Bytes ReadAll(const std::string& path) {
-  std::ifstream file(path, std::ios::binary);
-  return Bytes((std::istreambuf_iterator<char>(file)), std::istreambuf_iterator<char>());
-}
-
 struct ManifestFixture {
   Bytes manifest;
   Bytes imageDigest;
@@ -146,7 +124,7 @@ const ManifestFixture& Manifest() {
     manifest.insert(manifest.end(), device.begin(), device.end());
     if (Run(identity) != 0 || Run(manifest) != 0) std::abort();
     brisvale::device::SetDeviceIdentityPath((TempDir() / "identity.plist").string());
-    ManifestFixture result{ReadAll((TempDir() / "manifest").string()), {}};
+    ManifestFixture result{brisvale::testing::ReadFileBytes(TempDir() / "manifest"), {}};
     brisvale::verify::DigestImageFile(image, &result.imageDigest, 48);
     return result;
   }();
@@ -163,7 +141,9 @@ void BM_VerifyPersonalizedManifest(benchmark::State& state) {
 }
 BENCHMARK(BM_VerifyPersonalizedManifest)->Unit(benchmark::kMicrosecond);
 
-Bytes DerFile(const std::string& name) { return ReadAll(std::string(BRISVALE_PKI_DIR) + "/" + name); }
+Bytes DerFile(const std::string& name) {
+  return brisvale::testing::ReadFileBytes(std::string(BRISVALE_PKI_DIR) + "/" + name);
+}
 
 // What any implementation has to do for the same manifest: import the root's and the
 // leaf's keys, verify the leaf certificate and the manifest body (RSA-4096 each), and

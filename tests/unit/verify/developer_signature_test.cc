@@ -12,107 +12,68 @@ namespace {
 
 using testing::Bytes;
 using testing::Pki;
+using Lines = std::vector<std::string>;
 
-class DeveloperSignatureTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    Bytes image(300000);
-    for (size_t i = 0; i < image.size(); ++i) image[i] = static_cast<uint8_t>(i % 251);
-    testing::WriteBytes(dir_ / "image", image);
-    image[123456] ^= 1;
-    testing::WriteBytes(dir_ / "tampered", image);
-  }
-
-  Bytes Sign(const std::string& key) {
-    std::string out = (dir_ / "signature").string();
-    EXPECT_TRUE(testing::RunImgtool(
-        {"sign-developer", "--key", Pki(key), "--image", (dir_ / "image").string(), "-o", out}));
-    return testing::ReadBytes(out);
-  }
-
-  Bytes Digest(const std::string& name) {
-    std::optional<plist::Bytes> digest = DigestFileSha1((dir_ / name).string());
-    EXPECT_TRUE(digest);
-    return digest.value_or(Bytes{});
-  }
-
-  testing::ScratchDir dir_;
-};
-
-TEST_F(DeveloperSignatureTest, TrustIsJudgedAtTheFixedInstant) {
+TEST(VerifyDeveloperImageSignature, TrustAtTheFixedInstantThenTheSignature) {
+  testing::ScratchDir dir;
+  Bytes image(300000);
+  for (size_t i = 0; i < image.size(); ++i) image[i] = static_cast<uint8_t>(i % 251);
+  testing::WriteFileBytes(dir / "image", image);
+  image[123456] ^= 1;
+  testing::WriteFileBytes(dir / "tampered", image);
+  const std::string ca = Pki("developer-ca.pem"), certificate = Pki("developer-signing.pem");
+  const std::string missingCa = (dir / "no-ca.pem").string();
+  const std::string missingCertificate = (dir / "no-cert.pem").string();
+  const Lines untrusted = {"Failed to evaluate trust: 5",
+                           "Failed to extract public key from the certificate."};
+  // `lines`: none when the signature is accepted.
   struct Case {
-    const char* key;
-    const char* certificate;
-    int result;
+    const char* key; std::string certificate; const char* image; std::string ca; Lines lines;
   } cases[] = {
-      {"developer-signing.key", "developer-signing.pem", 0},
+      {"developer-signing.key", certificate, "image", ca, {}},
       // Expired long after 2014-04-10: still trusted then.
-      {"developer-signing.key", "developer-signing-expired.pem", 0},
+      {"developer-signing.key", Pki("developer-signing-expired.pem"), "image", ca, {}},
       // Not yet valid at 2014-04-10, though valid today.
-      {"developer-signing.key", "developer-signing-future.pem", -1},
+      {"developer-signing.key", Pki("developer-signing-future.pem"), "image", ca, untrusted},
       // A valid signature from a certificate of another CA.
-      {"foreign-signing.key", "foreign-signing.pem", -1},
+      {"foreign-signing.key", Pki("foreign-signing.pem"), "image", ca, untrusted},
+      {"developer-signing.key", certificate, "tampered", ca, {"Failed to validate signature."}},
+      // Missing files fail before any trust work.
+      {"developer-signing.key", certificate, "image", missingCa,
+       {"Failed to open " + missingCa + ": 2", "Failed to load " + missingCa + ".",
+        "Failed to extract public key from the certificate."}},
+      {"developer-signing.key", missingCertificate, "image", ca,
+       {"Failed to open " + missingCertificate + ": 2",
+        "Failed to load the certificate at " + missingCertificate + "."}},
   };
   for (const Case& c : cases) {
+    const std::string signature = (dir / "signature").string();
+    ASSERT_TRUE(testing::RunImgtool({"sign-developer", "--key", Pki(c.key), "--image",
+                                     (dir / "image").string(), "-o", signature}));
+    const std::optional<plist::Bytes> digest = DigestFileSha1((dir / c.image).string());
+    ASSERT_TRUE(digest);
     log::CaptureSink capture;
-    EXPECT_EQ(VerifyDeveloperImageSignature(Sign(c.key), Pki(c.certificate), Digest("image"),
-                                            Pki("developer-ca.pem")),
-              c.result)
-        << c.certificate;
-    if (c.result != 0) {
-      EXPECT_EQ(capture.Texts(), (std::vector<std::string>{
-                                     "Failed to evaluate trust: 5",
-                                     "Failed to extract public key from the certificate."}));
-    }
-  }
-}
-
-TEST_F(DeveloperSignatureTest, SignatureCoversTheImageBytes) {
-  log::CaptureSink capture;
-  EXPECT_EQ(VerifyDeveloperImageSignature(Sign("developer-signing.key"), Pki("developer-signing.pem"),
-                                          Digest("tampered"), Pki("developer-ca.pem")),
-            -1);
-  EXPECT_EQ(capture.Texts(), std::vector<std::string>{"Failed to validate signature."});
-}
-
-TEST_F(DeveloperSignatureTest, MissingFilesFailBeforeAnyTrustWork) {
-  std::string missingCa = (dir_ / "no-ca.pem").string();
-  std::string missingCertificate = (dir_ / "no-cert.pem").string();
-  Bytes signature = Sign("developer-signing.key");
-  {
-    log::CaptureSink capture;
-    EXPECT_EQ(VerifyDeveloperImageSignature(signature, Pki("developer-signing.pem"),
-                                            Digest("image"), missingCa),
-              -1);
-    EXPECT_EQ(capture.Texts(), (std::vector<std::string>{
-                                   "Failed to open " + missingCa + ": 2",
-                                   "Failed to load " + missingCa + ".",
-                                   "Failed to extract public key from the certificate."}));
-  }
-  {
-    log::CaptureSink capture;
-    EXPECT_EQ(VerifyDeveloperImageSignature(signature, missingCertificate, Digest("image"),
-                                            Pki("developer-ca.pem")),
-              -1);
-    EXPECT_EQ(capture.Texts(), (std::vector<std::string>{
-                                   "Failed to open " + missingCertificate + ": 2",
-                                   "Failed to load the certificate at " + missingCertificate + "."}));
+    EXPECT_EQ(VerifyDeveloperImageSignature(testing::ReadFileBytes(signature), c.certificate,
+                                            *digest, c.ca),
+              c.lines.empty() ? 0 : -1)
+        << c.certificate << " " << c.ca;
+    EXPECT_EQ(capture.Texts(), c.lines) << c.certificate << " " << c.ca;
   }
 }
 
 TEST(CopyCertificateFromPEMFile, RefusesWhatIsNotAPemCertificate) {
   testing::ScratchDir dir;
-  testing::WriteBytes(dir / "der", testing::ReadBytes(Pki("developer-ca.der")));
-  testing::WriteBytes(dir / "empty", {});
-  for (const char* name : {"der", "empty"}) {
+  testing::WriteFileBytes(dir / "empty", {});
+  const std::pair<std::string, const char*> cases[] = {
+      {Pki("developer-ca.der"), "Failed to create certificate with PEM data."},
+      {(dir / "empty").string(), "Failed to create certificate with PEM data."},
+      {std::string(1024, 'a'), "Failed to create string."},
+  };
+  for (const auto& [path, line] : cases) {
     log::CaptureSink capture;
-    EXPECT_FALSE(CopyCertificateFromPEMFile((dir / name).string())) << name;
-    EXPECT_EQ(capture.Texts(),
-              std::vector<std::string>{"Failed to create certificate with PEM data."});
+    EXPECT_FALSE(CopyCertificateFromPEMFile(path)) << path;
+    EXPECT_EQ(capture.Texts(), Lines{line}) << path;
   }
-  log::CaptureSink capture;
-  EXPECT_FALSE(CopyCertificateFromPEMFile(std::string(1024, 'a')));
-  EXPECT_EQ(capture.Texts(), std::vector<std::string>{"Failed to create string."});
 }
 
 }  // namespace

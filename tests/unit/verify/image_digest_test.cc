@@ -25,7 +25,7 @@ TEST(DigestImageFile, MatchesOneShotDigestAtBufferBoundaries) {
                       2 * kDigestReadSize + 7}) {
     Bytes data(size);
     for (size_t i = 0; i < size; ++i) data[i] = static_cast<uint8_t>(i * 31 + size);
-    testing::WriteBytes(dir / "image", data);
+    testing::WriteFileBytes(dir / "image", data);
     for (auto [length, algorithm] : {std::pair{20L, crypto::DigestAlgorithm::Sha1},
                                      std::pair{48L, crypto::DigestAlgorithm::Sha384}}) {
       std::vector<uint8_t> digest;
@@ -37,15 +37,10 @@ TEST(DigestImageFile, MatchesOneShotDigestAtBufferBoundaries) {
 
 TEST(DigestImageFile, FailuresLogWhy) {
   testing::ScratchDir dir;
-  testing::WriteBytes(dir / "image", {1, 2, 3});
+  testing::WriteFileBytes(dir / "image", {1, 2, 3});
   std::string image = (dir / "image").string();
   std::string missing = (dir / "missing").string();
-  struct Case {
-    std::string path;
-    long length;
-    bool withOutput;
-    std::vector<std::string> lines;
-  } cases[] = {
+  struct Case { std::string path; long length; bool withOutput; std::vector<std::string> lines; } cases[] = {
       {image, 32, true, {"Unsupported digest size: 32", "Failed to digest data."}},
       {image, 0, true, {"Unsupported digest size: 0", "Failed to digest data."}},
       {image, 20, false, {"Invalid input"}},

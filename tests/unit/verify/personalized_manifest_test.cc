@@ -5,9 +5,9 @@
 
 #include <algorithm>
 #include <limits>
-#include <ostream>
 
 #include "base/log.h"
+#include "imgtool/options.h"
 #include "platform/device_properties.h"
 #include "test_support.h"
 #include "verify/image_digest.h"
@@ -22,132 +22,100 @@ const Args kDevice = {"--nonce", "00112233445566778899aabbccddeeff", "--board", 
                       "--chip", "0x8030", "--ecid", "0x1122334455667788",
                       "--production", "true", "--security", "true"};
 
-struct Case {
-  const char* name;
-  Args manifest;            // beyond the device's own values and the image
-  Args identity;            // replaces the device's values when not empty
-  const char* hashMethod;   // nullptr: none recorded
-  long digestLength;        // how the image is digested before the check
-  int result;
-  Lines lastLines;          // the final default-level lines
-};
-
-void PrintTo(const Case& c, std::ostream* os) { *os << c.name; }
-
-// The device's options with those of `overrides` replacing them, then the rest.
-Args Merge(const Args& device, const Args& overrides) {
-  Args merged = device;
-  for (size_t i = 0; i < overrides.size(); ++i) {
+// The device's options, each "--option value" pair of `overrides` replacing or added.
+Args Merge(Args merged, const Args& overrides) {
+  for (size_t i = 0; i + 1 < overrides.size(); i += 2) {
     auto found = std::find(merged.begin(), merged.end(), overrides[i]);
-    bool takesValue = i + 1 < overrides.size() && overrides[i + 1].rfind("--", 0) != 0;
-    if (found != merged.end() && takesValue) {
-      *(found + 1) = overrides[++i];
+    if (found != merged.end()) {
+      *(found + 1) = overrides[i + 1];
     } else {
-      merged.push_back(overrides[i]);
-      if (takesValue) merged.push_back(overrides[++i]);
+      merged.insert(merged.end(), {overrides[i], overrides[i + 1]});
     }
   }
   return merged;
 }
 
-class PersonalizedManifestTest : public ::testing::TestWithParam<Case> {
- protected:
-  void TearDown() override { device::SetDeviceIdentityPath(""); }
-  testing::ScratchDir dir_;
-};
-
-TEST_P(PersonalizedManifestTest, ChecksDeviceAndImage) {
-  const Case& c = GetParam();
-  std::string image = (dir_ / "image").string();
-  testing::WriteBytes(image, testing::Bytes(70000, 0xA5));
-
-  Args identity = {"identity", "-o", (dir_ / "identity.plist").string()};
-  const Args& deviceValues = c.identity.empty() ? kDevice : c.identity;
-  identity.insert(identity.end(), deviceValues.begin(), deviceValues.end());
-  if (c.hashMethod) identity.insert(identity.end(), {"--hash-method", c.hashMethod});
-  ASSERT_TRUE(testing::RunImgtool(identity));
-  device::SetDeviceIdentityPath((dir_ / "identity.plist").string());
-
-  Args manifest = {"manifest", "--image", image, "-o", (dir_ / "manifest").string()};
-  Args values = Merge(kDevice, c.manifest);
-  manifest.insert(manifest.end(), values.begin(), values.end());
-  ASSERT_TRUE(testing::RunImgtool(manifest));
-
-  std::vector<uint8_t> digest;
-  ASSERT_EQ(DigestImageFile(image, &digest, c.digestLength), 0);
-  log::CaptureSink capture;
-  EXPECT_EQ(VerifyPersonalizedManifest(testing::ReadBytes(dir_ / "manifest"), digest), c.result);
-  Lines lines = capture.Texts(Level::Default);
-  EXPECT_EQ(lines, c.lastLines);
+// The two lines of a manifest tag that does not match the device or the image.
+Lines TagRefused(const std::string& tag) {
+  return {"Failed to validate manifest tag: " + tag, "Failed to evaluate trust: -1"};
 }
 
-const Case kCases[] = {
-    {"Sha384Matches", {}, {}, "sha384", 48, 0, {}},
-    {"Sha1Matches", {"--chain", "sha1", "--dgst", "sha1"}, {}, "sha1", 20, 0, {}},
-    {"ModesAsIntegers", {}, {[] { Args a = kDevice; a.push_back("--numbers"); return a; }()},
-     "sha384", 48, 0, {}},
-    {"UnknownTagAccepted", {"--property", "XXXX=int:7", "--object-property", "YYYY=str:z"}, {},
-     "sha384", 48, 0, {}},
-    {"PinnedValueHonoured", {"--leaf-constraint", "CHIP=int:0x8030"}, {}, "sha384", 48, 0, {}},
-    {"AnotherDevice", {"--ecid", "0x1122334455667789"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: ECID", "Failed to evaluate trust: -1"}},
-    {"EcidHighBitsCount", {"--ecid", "0x0000000055667788"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: ECID", "Failed to evaluate trust: -1"}},
-    {"OtherBoard", {"--board", "9"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: BORD", "Failed to evaluate trust: -1"}},
-    {"OtherImage", {"--dgst", "hex:" + std::string(96, '0')}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: DGST", "Failed to evaluate trust: -1"}},
-    {"DigestLengthDiffers", {"--dgst", "sha1"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: DGST", "Failed to evaluate trust: -1"}},
-    {"EkeyFalse", {"--ekey", "false"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: EKEY", "Failed to evaluate trust: -1"}},
-    {"SdomZero", {"--sdom", "0"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: SDOM", "Failed to evaluate trust: -1"}},
-    {"ProductionDiffers", {"--production", "false"}, {}, "sha384", 48, -1,
-     {"Failed to validate manifest tag: CPRO", "Failed to evaluate trust: -1"}},
-    {"DeviceWithoutNonce",
-     {},
-     {"--board", "8", "--chip", "0x8030", "--ecid", "0x1122334455667788", "--production", "true",
-      "--security", "true"},
-     "sha384", 48, -1,
-     {"Failed to validate manifest tag: BNCH", "Failed to evaluate trust: -1"}},
-    // The leaf pins another chip: its constraint fails before any tag rule runs.
-    {"PinnedValueBroken", {"--leaf-constraint", "CHIP=int:1"}, {}, "sha384", 48, -1,
-     {"Failed to evaluate trust: -1"}},
-    // A leaf without the constraint extension has nothing to evaluate: a decode error.
-    {"LeafWithoutConstraintExtension", {"--leaf", "plain"}, {}, "sha384", 48, -1,
-     {"Failed to evaluate trust: 3"}},
-    // Any text but "sha1" selects the one-certificate SHA-384 chain.
-    {"EmptyHashMethodIsSha384", {"--chain", "sha1", "--dgst", "sha1"}, {}, "", 20, -1,
-     {"Failed to evaluate trust: -1"}},
-    {"UpperCaseSha1IsSha384", {}, {}, "SHA1", 48, 0, {}},
-    {"Sha1MethodRefusesSha384Chain", {}, {}, "sha1", 48, -1, {"Failed to evaluate trust: -1"}},
-    {"NoHashMethod", {}, {}, nullptr, 48, -1, {"Failed to retrieve Qor4CryptoHashMethod."}},
-    {"NoDiskImageObject", {"--object", "pdmX"}, {}, "sha384", 48, -1,
-     {"Failed to evaluate trust: 1"}},
-};
-
-INSTANTIATE_TEST_SUITE_P(Manifests, PersonalizedManifestTest, ::testing::ValuesIn(kCases),
-                         [](const auto& info) { return std::string(info.param.name); });
+TEST(VerifyPersonalizedManifest, ChecksDeviceAndImage) {
+  const Args withoutNonce(kDevice.begin() + 2, kDevice.end());
+  Args withNumbers = kDevice;
+  withNumbers.push_back("--numbers");
+  const Lines untrusted = {"Failed to evaluate trust: -1"};
+  struct Case {
+    const char* name;
+    Args manifest;  // beyond the device's own values and the image
+    Args identity;  // replaces the device's values when not empty
+    int result;
+    Lines lines;                         // the default-level lines
+    const char* hashMethod = "sha384";  // nullptr: none recorded
+    long digestLength = 48;              // how the image is digested before the check
+  } cases[] = {
+      {"Sha384Matches", {}, {}, 0, {}},
+      {"Sha1Matches", {"--chain", "sha1", "--dgst", "sha1"}, {}, 0, {}, "sha1", 20},
+      {"ModesAsIntegers", {}, withNumbers, 0, {}},
+      {"UnknownTagAccepted", {"--property", "XXXX=int:7", "--object-property", "YYYY=str:z"}, {}, 0, {}},
+      {"PinnedValueHonoured", {"--leaf-constraint", "CHIP=int:0x8030"}, {}, 0, {}},
+      {"AnotherDevice", {"--ecid", "0x1122334455667789"}, {}, -1, TagRefused("ECID")},
+      {"EcidHighBitsCount", {"--ecid", "0x0000000055667788"}, {}, -1, TagRefused("ECID")},
+      {"OtherBoard", {"--board", "9"}, {}, -1, TagRefused("BORD")},
+      {"OtherImage", {"--dgst", "hex:" + std::string(96, '0')}, {}, -1, TagRefused("DGST")},
+      {"DigestLengthDiffers", {"--dgst", "sha1"}, {}, -1, TagRefused("DGST")},
+      {"EkeyFalse", {"--ekey", "false"}, {}, -1, TagRefused("EKEY")},
+      {"SdomZero", {"--sdom", "0"}, {}, -1, TagRefused("SDOM")},
+      {"ProductionDiffers", {"--production", "false"}, {}, -1, TagRefused("CPRO")},
+      {"DeviceWithoutNonce", {}, withoutNonce, -1, TagRefused("BNCH")},
+      // The leaf pins another chip: its constraint fails before any tag rule runs.
+      {"PinnedValueBroken", {"--leaf-constraint", "CHIP=int:1"}, {}, -1, untrusted},
+      // A leaf without the constraint extension has nothing to evaluate: a decode error.
+      {"LeafWithoutConstraintExtension", {"--leaf", "plain"}, {}, -1, {"Failed to evaluate trust: 3"}},
+      // Any text but "sha1" selects the one-certificate SHA-384 chain.
+      {"EmptyHashMethodIsSha384", {"--chain", "sha1", "--dgst", "sha1"}, {}, -1, untrusted, "", 20},
+      {"UpperCaseSha1IsSha384", {}, {}, 0, {}, "SHA1"},
+      {"Sha1MethodRefusesSha384Chain", {}, {}, -1, untrusted, "sha1"},
+      {"NoHashMethod", {}, {}, -1, {"Failed to retrieve Qor4CryptoHashMethod."}, nullptr},
+      {"NoDiskImageObject", {"--object", "pdmX"}, {}, -1, {"Failed to evaluate trust: 1"}},
+  };
+  testing::ScratchDir dir;
+  const std::string image = (dir / "image").string(), identityFile = (dir / "identity.plist").string();
+  testing::WriteFileBytes(image, testing::Bytes(70000, 0xA5));
+  device::SetDeviceIdentityPath(identityFile);
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    Args identity = {"identity", "-o", identityFile};
+    const Args& deviceValues = c.identity.empty() ? kDevice : c.identity;
+    identity.insert(identity.end(), deviceValues.begin(), deviceValues.end());
+    if (c.hashMethod) identity.insert(identity.end(), {"--hash-method", c.hashMethod});
+    Args manifest = {"manifest", "--image", image, "-o", (dir / "manifest").string()};
+    const Args values = Merge(kDevice, c.manifest);
+    manifest.insert(manifest.end(), values.begin(), values.end());
+    std::vector<uint8_t> digest;
+    EXPECT_TRUE(testing::RunImgtool(identity) && testing::RunImgtool(manifest));
+    EXPECT_EQ(DigestImageFile(image, &digest, c.digestLength), 0);
+    log::CaptureSink capture;
+    EXPECT_EQ(VerifyPersonalizedManifest(testing::ReadFileBytes(dir / "manifest"), digest), c.result);
+    EXPECT_EQ(capture.Texts(Level::Default), c.lines);
+  }
+  device::SetDeviceIdentityPath("");
+}
 
 TEST(VerifyPersonalizedManifest, UndecodableManifestFailsFirst) {
-  std::vector<uint8_t> digest(48);
-  struct {
-    testing::Bytes bytes;
-    const char* line;
-  } cases[] = {
+  const std::pair<testing::Bytes, const char*> cases[] = {
       {{}, "Failed to initialize qor4 manifest: 6"},
       {{0x31, 0x00}, "Failed to initialize qor4 manifest: 2"},
   };
-  for (const auto& c : cases) {
+  for (const auto& [bytes, line] : cases) {
     log::CaptureSink capture;
-    EXPECT_EQ(VerifyPersonalizedManifest(c.bytes, digest), -1);
-    EXPECT_EQ(capture.Texts(), Lines{c.line});
+    EXPECT_EQ(VerifyPersonalizedManifest(bytes, std::vector<uint8_t>(48)), -1);
+    EXPECT_EQ(capture.Texts(), Lines{line});
   }
 }
 
 TEST(EvaluateManifestProperty, UnhandledTagIsOnlyADebugNote) {
-  testing::Bytes property = testing::FromHex("300916045858585802012a");  // SEQ { "XXXX", 42 }
+  testing::Bytes property = imgtool::ParseHex("300916045858585802012a", "property");  // SEQ { "XXXX", 42 }
   device::DeviceIdentity identity;
   ManifestCheckContext check{{}, &identity};
   log::CaptureSink capture;

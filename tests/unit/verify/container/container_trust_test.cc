@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <string>
+#include <tuple>
 #include <utility>
 
 #include "qor4_test_support.h"
@@ -15,17 +16,8 @@ using namespace derwriter;
 
 constexpr uint32_t kPdmg = 0x70646D67;
 
-struct Delivered {
-  std::string code;
-  uint32_t kind;
-  DERTag valueTag;
-  bool operator==(const Delivered&) const = default;
-};
-
-std::string CodeText(uint32_t code) {
-  return {static_cast<char>(code >> 24), static_cast<char>(code >> 16), static_cast<char>(code >> 8),
-          static_cast<char>(code)};
-}
+// A delivered property: its code, its kind (0 manifest, 1 object) and its value's tag.
+using Delivered = std::tuple<std::string, uint32_t, DERTag>;
 
 struct Recorder {
   std::vector<Delivered> delivered;
@@ -35,7 +27,9 @@ struct Recorder {
 
 int Record(uint32_t tag, Qor4PropertyRef property, uint32_t kind, void* context) {
   auto* recorder = static_cast<Recorder*>(context);
-  recorder->delivered.push_back({CodeText(tag), kind, property.valueTag});
+  const char code[] = {static_cast<char>(tag >> 24), static_cast<char>(tag >> 16),
+                       static_cast<char>(tag >> 8), static_cast<char>(tag)};
+  recorder->delivered.emplace_back(std::string(code, 4), kind, property.valueTag);
   return recorder->stopWith;
 }
 
@@ -82,13 +76,6 @@ TEST_F(TrustEvaluation, DeliversManifestPropertiesThenObjectInEncodingOrder) {
   EXPECT_EQ(0, std::memcmp(bodyDigest, Slots().signedDigest, 48));
 }
 
-TEST_F(TrustEvaluation, MissingObjectFailsAfterTheSignature) {
-  EXPECT_EQ(DERResultEndOfSequence, Evaluate(DefaultManifest(), Qor4Code("none")));
-  EXPECT_EQ(1, Slots().signatureCalls);
-  EXPECT_EQ(0, Slots().certificateCalls);
-  EXPECT_TRUE(recorder_.delivered.empty());
-}
-
 TEST_F(TrustEvaluation, StoredManifestHashSkipsChecksButDeliversEverything) {
   const Bytes manifest = DefaultManifest();
   uint8_t accepted[48];
@@ -105,61 +92,55 @@ TEST_F(TrustEvaluation, StoredManifestHashSkipsChecksButDeliversEverything) {
 }
 
 TEST_F(TrustEvaluation, FirstFailureIsTheResult) {
-  struct Case {
-    const char* name;
-    int SlotState::*slot;
-    int expectedSignatureCalls;
-  };
-  const Case cases[] = {{"digest", &SlotState::digestResult, 0},
-                        {"chain", &SlotState::chainResult, 0},
-                        {"signature", &SlotState::signatureResult, 1},
-                        {"certificate", &SlotState::certificateResult, 1}};
-  for (const Case& c : cases) {
-    Slots() = SlotState{};
-    Slots().*c.slot = 42;
-    recorder_.delivered.clear();
-    EXPECT_EQ(42, Evaluate(DefaultManifest())) << c.name;
-    EXPECT_EQ(c.expectedSignatureCalls, Slots().signatureCalls) << c.name;
-    EXPECT_TRUE(recorder_.delivered.empty()) << c.name;
-  }
-  Slots() = SlotState{};
-  recorder_.stopWith = -7;
-  EXPECT_EQ(-7, Evaluate(DefaultManifest()));
-  EXPECT_EQ(1u, recorder_.delivered.size());
-}
-
-TEST_F(TrustEvaluation, RefusesIncompleteParametersAndLongDigests) {
-  Qor4SecureBootParams noChain = kFakeParams;
-  noChain.verifyChain = nullptr;
-  EXPECT_EQ(DERResultParamError, Evaluate(DefaultManifest(), kPdmg, noChain));
   static constexpr Qor4DigestInfo kTooLong = {49, nullptr, std::nullopt};
-  Qor4SecureBootParams longDigest = kFakeParams;
+  Qor4SecureBootParams noChain = kFakeParams, longDigest = kFakeParams;
+  noChain.verifyChain = nullptr;
   longDigest.digestInfo = &kTooLong;
-  EXPECT_EQ(DERResultOverflow, Evaluate(DefaultManifest(), kPdmg, longDigest));
-
-  Qor4DecodeContext empty{};
+  // `failingSlot` is made to answer 42; `stopWith` is the property callback's answer.
+  const struct {
+    const char* name; int SlotState::*failingSlot; int stopWith; uint32_t object;
+    const Qor4SecureBootParams* params; int result, signatureCalls, certificateCalls; size_t delivered;
+  } cases[] = {
+      {"digest", &SlotState::digestResult, 0, kPdmg, &kFakeParams, 42, 0, 0, 0},
+      {"chain", &SlotState::chainResult, 0, kPdmg, &kFakeParams, 42, 0, 0, 0},
+      {"signature", &SlotState::signatureResult, 0, kPdmg, &kFakeParams, 42, 1, 0, 0},
+      {"certificate", &SlotState::certificateResult, 0, kPdmg, &kFakeParams, 42, 1, 1, 0},
+      {"property callback", nullptr, -7, kPdmg, &kFakeParams, -7, 1, 1, 1},
+      {"missing object", nullptr, 0, Qor4Code("none"), &kFakeParams, DERResultEndOfSequence, 1, 0, 0},
+      {"no chain slot", nullptr, 0, kPdmg, &noChain, DERResultParamError, 0, 0, 0},
+      {"digest longer than 48", nullptr, 0, kPdmg, &longDigest, DERResultOverflow, 0, 0, 0},
+  };
+  for (const auto& c : cases) {
+    Slots() = SlotState{};
+    if (c.failingSlot) Slots().*c.failingSlot = 42;
+    recorder_ = Recorder{{}, c.stopWith, nullptr};
+    EXPECT_EQ(c.result, Evaluate(DefaultManifest(), c.object, *c.params)) << c.name;
+    EXPECT_EQ(c.signatureCalls, Slots().signatureCalls) << c.name;
+    EXPECT_EQ(c.certificateCalls, Slots().certificateCalls) << c.name;
+    EXPECT_EQ(c.delivered, recorder_.delivered.size()) << c.name;
+  }
+  Qor4DecodeContext uninitialized{};
   const Qor4PropertyCallbacks callbacks = {Record, nullptr};
   EXPECT_EQ(DERResultParamError, Qor4DecodePerformTrustEvaluatationWithCallbacks(
-                                     kPdmg, &empty, &callbacks, &kFakeParams, &recorder_));
+                                     kPdmg, &uninitialized, &callbacks, &kFakeParams, &recorder_));
 }
 
 TEST_F(TrustEvaluation, RefusesPropertiesThatCannotBeDelivered) {
-  const Bytes sequenceValue = Property("BORD", Sequence({}));
-  EXPECT_EQ(DERResultUnexpectedTag, Evaluate(DefaultManifest(ManifestBody({sequenceValue}, {{"pdmg", {}}}))));
-  const Bytes contextClass = Constructed(ContextTag(FourCC("BORD"), true),
-                                         {Sequence({IA5String("BORD"), Integer(1)})});
-  EXPECT_EQ(0, Evaluate(DefaultManifest(ManifestBody({contextClass}, {{"pdmg", {}}}))));
-  const Bytes universalClass = Constructed(kConstructed | FourCC("BORD"),
-                                           {Sequence({IA5String("BORD"), Integer(1)})});
-  EXPECT_EQ(DERResultUnexpectedTag,
-            Evaluate(DefaultManifest(ManifestBody({universalClass}, {{"pdmg", {}}}))));
+  const Bytes bord = Sequence({IA5String("BORD"), Integer(1)});
+  const std::pair<Bytes, int> cases[] = {
+      {Property("BORD", Sequence({})), DERResultUnexpectedTag},
+      {Constructed(ContextTag(FourCC("BORD"), true), {bord}), 0},
+      {Constructed(kConstructed | FourCC("BORD"), {bord}), DERResultUnexpectedTag},
+  };
+  for (const auto& [property, result] : cases) {
+    EXPECT_EQ(result, Evaluate(DefaultManifest(ManifestBody({property}, {{"pdmg", {}}}))));
+  }
 }
 
 TEST_F(TrustEvaluation, FixedLengthEntryHashesManifestLast) {
   manifest_ = DefaultManifest();
   ASSERT_EQ(0, Qor4DecodeInitManifest(manifest_.data(), static_cast<uint32_t>(manifest_.size()), &context_));
   static int hashes = 0;
-  hashes = 0;
   auto hash = [](const uint8_t* data, uint32_t length, uint8_t* out) {
     hashes++;
     FakeDigest(data, length, out, 20);
@@ -176,67 +157,48 @@ TEST_F(TrustEvaluation, FixedLengthEntryHashesManifestLast) {
   EXPECT_EQ(10u, recorder_.delivered.size());
 }
 
-// --- Leaf certificate constraints ------------------------------------------------------
-
-struct ConstraintCase {
-  std::string name;
-  Bytes constraints;  // the extension value: a SET of groups
-  int result;
-};
-
-Bytes Group(const char* code, const std::vector<Bytes>& constraints) {
-  return Dictionary(code, constraints);
+// The leaf certificate's constraints: a SET of groups, each pinning manifest ("MANP") or
+// object ("OBJP") properties to a value, or to being present or optional.
+TEST_F(TrustEvaluation, CertificateConstraints) {
+  auto manp = [](const std::vector<Bytes>& pins) { return Dictionary("MANP", pins); };
+  auto objp = [](const std::vector<Bytes>& pins) { return Dictionary("OBJP", pins); };
+  auto presence = [](const char* code, uint64_t optional) {
+    return Property(code, Constructed(ContextTag(optional, true), {}));
+  };
+  // Each row's constraints are the extension value.
+  const struct { const char* name; Bytes constraints; int result; } cases[] = {
+      {"NoExtension", {}, DERResultDecodeError},
+      {"EmptySet", Set({}), DERResultSuccess},
+      {"NotASet", Sequence({}), DERResultUnexpectedTag},
+      {"IntegerEqual", Set({manp({IntegerProperty("BORD", 0x10)})}), 0},
+      {"IntegerDiffers", Set({manp({IntegerProperty("BORD", 0x11)})}), -1},
+      {"BooleanEqual", Set({manp({BooleanProperty("CSEC", false)})}), 0},
+      {"BooleanDiffers", Set({manp({BooleanProperty("CPRO", false)})}), -1},
+      {"DataDiffers", Set({manp({DataProperty("BNCH", Bytes{1, 2})})}), -1},
+      {"PinnedValueMissing", Set({manp({IntegerProperty("XTRA", 1)})}), DERResultEndOfSequence},
+      {"ObjectDataEqual", Set({objp({DataProperty("DGST", Bytes(48, 0xD5))})}), 0},
+      {"ObjectGroupDoesNotSeeManifest", Set({objp({IntegerProperty("BORD", 0x10)})}),
+       DERResultEndOfSequence},
+      {"RequiredPresent", Set({manp({presence("BNCH", 0)})}), 0},
+      {"RequiredMissing", Set({manp({presence("XTRA", 0)})}), DERResultEndOfSequence},
+      {"OptionalMissing", Set({manp({presence("XTRA", 1)})}), 0},
+      {"UnknownValueTag", Set({manp({StringProperty("BNCH", "x")})}), DERResultUnexpectedTag},
+      {"UnknownGroup", Set({Dictionary("ABCD", {})}), DERResultUnexpectedTag},
+      {"GroupValueNotSet", Set({Property("MANP", Integer(1))}), DERResultUnexpectedTag},
+      {"UndecodableTailEndsTheList",
+       Element(kTagSet, Concat({manp({IntegerProperty("BORD", 0x10)}), Bytes{0x04},
+                                manp({IntegerProperty("BORD", 0x11)})})),
+       0},
+      {"SecondGroupChecked",
+       Set({manp({IntegerProperty("BORD", 0x10)}), objp({BooleanProperty("EKEY", false)})}), -1},
+  };
+  for (const auto& c : cases) {
+    Slots() = SlotState{};
+    Slots().useRealCertificateEvaluation = true;
+    Slots().certificateProperties = c.constraints;
+    EXPECT_EQ(c.result, Evaluate(DefaultManifest())) << c.name;
+  }
 }
-Bytes Pinned(const char* code, uint64_t contextNumber) {
-  return Property(code, Constructed(ContextTag(contextNumber, true), {}));
-}
-
-class CertificateConstraints : public TrustEvaluation,
-                               public testing::WithParamInterface<ConstraintCase> {};
-
-TEST_P(CertificateConstraints, Result) {
-  Slots().useRealCertificateEvaluation = true;
-  Slots().certificateProperties = GetParam().constraints;
-  EXPECT_EQ(GetParam().result, Evaluate(DefaultManifest()));
-}
-
-INSTANTIATE_TEST_SUITE_P(
-    Qor4, CertificateConstraints,
-    testing::Values(
-        ConstraintCase{"NoExtension", {}, DERResultDecodeError},
-        ConstraintCase{"EmptySet", Set({}), DERResultSuccess},
-        ConstraintCase{"NotASet", Sequence({}), DERResultUnexpectedTag},
-        ConstraintCase{"IntegerEqual", Set({Group("MANP", {IntegerProperty("BORD", 0x10)})}), 0},
-        ConstraintCase{"IntegerDiffers", Set({Group("MANP", {IntegerProperty("BORD", 0x11)})}), -1},
-        ConstraintCase{"BooleanEqual", Set({Group("MANP", {BooleanProperty("CSEC", false)})}), 0},
-        ConstraintCase{"BooleanDiffers", Set({Group("MANP", {BooleanProperty("CPRO", false)})}), -1},
-        ConstraintCase{"DataDiffers", Set({Group("MANP", {DataProperty("BNCH", Bytes{1, 2})})}), -1},
-        ConstraintCase{"PinnedValueMissing", Set({Group("MANP", {IntegerProperty("XTRA", 1)})}),
-                       DERResultEndOfSequence},
-        ConstraintCase{"ObjectDataEqual",
-                       Set({Group("OBJP", {DataProperty("DGST", Bytes(48, 0xD5))})}), 0},
-        ConstraintCase{"ObjectGroupDoesNotSeeManifest",
-                       Set({Group("OBJP", {IntegerProperty("BORD", 0x10)})}),
-                       DERResultEndOfSequence},
-        ConstraintCase{"RequiredPresent", Set({Group("MANP", {Pinned("BNCH", 0)})}), 0},
-        ConstraintCase{"RequiredMissing", Set({Group("MANP", {Pinned("XTRA", 0)})}),
-                       DERResultEndOfSequence},
-        ConstraintCase{"OptionalMissing", Set({Group("MANP", {Pinned("XTRA", 1)})}), 0},
-        ConstraintCase{"UnknownValueTag", Set({Group("MANP", {StringProperty("BNCH", "x")})}),
-                       DERResultUnexpectedTag},
-        ConstraintCase{"UnknownGroup", Set({Group("ABCD", {})}), DERResultUnexpectedTag},
-        ConstraintCase{"GroupValueNotSet", Set({Property("MANP", Integer(1))}),
-                       DERResultUnexpectedTag},
-        ConstraintCase{"UndecodableTailEndsTheList",
-                       Element(kTagSet, Concat({Group("MANP", {IntegerProperty("BORD", 0x10)}),
-                                                Bytes{0x04},
-                                                Group("MANP", {IntegerProperty("BORD", 0x11)})})),
-                       0},
-        ConstraintCase{"SecondGroupChecked",
-                       Set({Group("MANP", {IntegerProperty("BORD", 0x10)}),
-                            Group("OBJP", {BooleanProperty("EKEY", false)})}),
-                       -1}),
-    [](const testing::TestParamInfo<ConstraintCase>& info) { return info.param.name; });
 
 }  // namespace
 }  // namespace brisvale

@@ -13,31 +13,19 @@ namespace brisvale::testing_support {
 
 using derwriter::Bytes;
 
-inline DERItem ItemOf(const Bytes& bytes) {
-  return {bytes.data(), static_cast<uint32_t>(bytes.size())};
-}
-
 inline std::vector<Bytes> DefaultManifestProperties() {
   using namespace derwriter;
-  return {DataProperty("BNCH", Bytes{1, 2, 3, 4, 5, 6, 7, 8}),
-          IntegerProperty("BORD", 0x10),
-          IntegerProperty("CHIP", 0x8020),
-          BooleanProperty("CPRO", true),
-          BooleanProperty("CSEC", false),
-          IntegerProperty("ECID", 0x1122334455667788ull),
-          IntegerProperty("SDOM", 1)};
-}
-
-inline std::vector<Bytes> DefaultObjectProperties() {
-  using namespace derwriter;
-  return {DataProperty("DGST", Bytes(48, 0xD5)), StringProperty("pdnm", "DebugDiskImage"),
-          BooleanProperty("EKEY", true)};
+  return {DataProperty("BNCH", Bytes{1, 2, 3, 4, 5, 6, 7, 8}), IntegerProperty("BORD", 0x10),
+          IntegerProperty("CHIP", 0x8020), BooleanProperty("CPRO", true), BooleanProperty("CSEC", false),
+          IntegerProperty("ECID", 0x1122334455667788ull), IntegerProperty("SDOM", 1)};
 }
 
 inline Bytes DefaultBody() {
   using namespace derwriter;
   return ManifestBody(DefaultManifestProperties(),
-                      {{"krnl", {IntegerProperty("ESEC", 1)}}, {"pdmg", DefaultObjectProperties()}});
+                      {{"krnl", {IntegerProperty("ESEC", 1)}},
+                       {"pdmg", {DataProperty("DGST", Bytes(48, 0xD5)),
+                                 StringProperty("pdnm", "DebugDiskImage"), BooleanProperty("EKEY", true)}}});
 }
 
 inline Bytes DefaultManifest(const Bytes& body = DefaultBody()) {
@@ -62,13 +50,10 @@ inline int FakeDigest(const uint8_t* data, uint32_t length, uint8_t* output,
 
 // What the fake slots do and saw. Tests reset it through Slots().
 struct SlotState {
-  int digestResult = 0;
-  int chainResult = 0;
-  int signatureResult = 0;
-  int certificateResult = 0;
+  int digestResult = 0, chainResult = 0, signatureResult = 0, certificateResult = 0;
   bool useRealCertificateEvaluation = false;
-  Bytes certificateProperties;
-  int digestCalls = 0, chainCalls = 0, signatureCalls = 0, certificateCalls = 0;
+  Bytes certificateProperties;  // what the chain slot hands over as the leaf's constraints
+  int chainCalls = 0, signatureCalls = 0, certificateCalls = 0;
   uint8_t signedDigest[kQor4MaxDigestLength] = {};
 };
 
@@ -79,9 +64,7 @@ inline SlotState& Slots() {
 
 inline int SlotComputeDigest(const uint8_t* data, uint32_t length, uint8_t* output,
                              uint32_t outputLength, const Qor4SecureBootParams*) {
-  Slots().digestCalls++;
-  if (Slots().digestResult != 0) return Slots().digestResult;
-  return FakeDigest(data, length, output, outputLength);
+  return Slots().digestResult != 0 ? Slots().digestResult : FakeDigest(data, length, output, outputLength);
 }
 
 inline int SlotVerifyChain(const uint8_t* chain, uint32_t chainLength, const uint8_t** key,
