@@ -3,13 +3,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "base/log.h"
 #include "diskimage/attach.h"
 #include "diskimage/verified_mount.h"
-#include "file_tree_os.h"
-#include "platform/services.h"
-#include "qor4_test_support.h"
-#include "registry/registry_model.h"
+#include "disk_image_fixture.h"
 
 namespace brisvale {
 namespace {
@@ -21,19 +17,12 @@ using testing::kLink;
 
 constexpr const char* kImage = "/private/var/stage/image.img";
 
-derwriter::Bytes ManifestWithDigestLength(size_t length) {
-  using namespace derwriter;
-  return testing_support::DefaultManifest(
-      ManifestBody(testing_support::DefaultManifestProperties(),
-                   {{"pdmg", {DataProperty("DGST", Bytes(length, 1)), DataProperty("pdnm", Bytes{'D'})}}}));
-}
-
 plist::Dictionary Medium(const std::string& bsdName) {
   return {{"BSD Name", plist::Value(bsdName)}, {"Content", ""}, {"Removable", plist::Value::Bool(false)},
           {"Leaf", plist::Value::Bool(true)}};
 }
 
-struct VerifiedMountTest : ::testing::Test {
+struct VerifiedMountTest : testing::DiskImageTest {
   VerifiedMountTest() {
     for (const char* dir : {"/", "/private", "/private/var", "/private/var/stage", "/Developer",
                             "/private/var/personalized_debug"}) {
@@ -63,10 +52,6 @@ struct VerifiedMountTest : ::testing::Test {
     os.mounts.push_back({os::kMountReadOnly, "ext4", mountPath, "/dev/" + bsdName});
   }
 
-  testing::FileTreeOs os;
-  registry::RegistryModel registry;
-  log::CaptureSink capture;
-  ScopedServices services{Services{&registry, &os, nullptr, nullptr}};
   MountSteps steps;
   int signatureResult = 0, trustCacheResult = 0;
   std::optional<std::string> attachResult = "/dev/loop7";
@@ -135,7 +120,7 @@ TEST_F(VerifiedMountTest, DigestComesFromTheVerifiedDescriptorAndFindsAnIdentica
   // A digest length the manifest cannot ask for stops before anything is looked up.
   os.AddFile(kImage, kFile);
   capture.Clear();
-  EXPECT_FALSE(Mount("Personalized", "/private/var/personalized_debug", ManifestWithDigestLength(32)).imageDigest);
+  EXPECT_FALSE(Mount("Personalized", "/private/var/personalized_debug", testing::ManifestOf("DebugDiskImage", 32)).imageDigest);
   EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre("Unsupported digest size: 32", "Failed to digest data.",
                                           "Failed to digest /private/var/stage/image.img."));
 }
