@@ -59,11 +59,13 @@ struct VerifiedMountTest : testing::DiskImageTest {
 
 TEST_F(VerifiedMountTest, EachStepEndsTheAttemptWithItsLineUndoesWhatItMadeAndConsumesTheImage) {
   const std::string unlink = std::string("unlink ") + kImage, open = std::string("open-image ") + kImage;
+  const derwriter::Bytes manifest = testing::ManifestOf("DebugDiskImage");
   struct Case {
     const char* name;
     std::function<void(VerifiedMountTest&)> arrange;
     std::vector<std::string> lines, calls;
     std::string mountPath = "/Developer";
+    const char* type = "Developer";
   };
   const std::vector<Case> cases = {
       {"missing", [](auto& t) { t.os.files.erase(kImage); },
@@ -78,6 +80,9 @@ TEST_F(VerifiedMountTest, EachStepEndsTheAttemptWithItsLineUndoesWhatItMadeAndCo
        {"Failed to take a read lease on /private/var/stage/image.img: 11"}, {open, unlink}},
       {"bad signature", [](auto& t) { t.signatureResult = -1; },
        {"Failed to verify the disk image signature."}, {open, unlink}},
+      {"ticket refused", [](auto& t) { t.signatureResult = -1; },
+       {"Failed to validate server ticket with this device/image"}, {open, unlink},
+       "/private/var/personalized_debug", "Personalized"},
       {"mount point not empty", [](auto& t) { t.os.AddFile("/Developer/stray", kFile); },
        {"/Developer is not empty.", "Failed to verify the disk image mount path /Developer."}, {open, unlink}},
       {"attach fails", [](auto& t) { t.attachResult.reset(); },
@@ -102,7 +107,7 @@ TEST_F(VerifiedMountTest, EachStepEndsTheAttemptWithItsLineUndoesWhatItMadeAndCo
     attachResult = "/dev/loop7";
     capture.Clear();
     c.arrange(*this);
-    EXPECT_EQ(Mount("Developer", c.mountPath).deviceNode.has_value(), std::string(c.name) == "mounted");
+    EXPECT_EQ(Mount(c.type, c.mountPath, manifest).deviceNode.has_value(), std::string(c.name) == "mounted");
     EXPECT_EQ(capture.Texts(log::Level::Default), c.lines);
     EXPECT_EQ(os.calls, c.calls);
   }
