@@ -2,13 +2,12 @@
 #include "registry/simulated_devices.h"
 
 #include <gtest/gtest.h>
-#include <unistd.h>
 
-#include <cstdlib>
 #include <fstream>
 
 #include "base/log.h"
 #include "base/runloop.h"
+#include "test_files.h"
 
 namespace brisvale::registry {
 namespace {
@@ -53,17 +52,10 @@ std::string DevicesFile(bool withStick, bool withCamera, bool stickWritable = fa
 
 class SimulatedDevicesTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    char name[] = "/tmp/brisvale-devices-XXXXXX";
-    int fd = mkstemp(name);
-    ASSERT_GE(fd, 0);
-    close(fd);
-    path = name;
-  }
-  void TearDown() override { unlink(path.c_str()); }
   void Write(const std::string& text) { std::ofstream(path, std::ios::trunc) << text; }
 
-  std::string path;
+  brisvale::testing::ScratchDir dir;
+  const std::string path = dir.str() + "/devices.plist";
   RunLoop loop;
   RegistryModel model;
 };
@@ -114,19 +106,18 @@ TEST_F(SimulatedDevicesTest, ReloadPublishesAddsAndTerminatesByPathInTheTree) {
   EXPECT_EQ(cameras.size(), 1u) << "the camera that stayed is not matched again";
 }
 
-TEST_F(SimulatedDevicesTest, UnusableFileKeepsTheRegistryAndSaysWhy) {
+TEST_F(SimulatedDevicesTest, UnusableFileKeepsTheRegistryAndSaysWhyAndGoingAwayTakesItsObjects) {
   Write(DevicesFile(true, true));
-  SimulatedDevices devices(model, path);
-  ASSERT_TRUE(devices.Reload());
-  size_t published = model.ObjectCount();
+  auto devices = std::make_unique<SimulatedDevices>(model, path);
+  ASSERT_TRUE(devices->Reload());
+  ASSERT_EQ(model.ObjectCount(), 5u);
 
-  struct Case {
+  const struct {
     const char* label;
     std::string text;
     const char* reason;
-  };
-  const Case cases[] = {
-      {"not a property list", "garbage", ""},
+  } cases[] = {
+      {"not a property list", "garbage", "syntax error"},
       {"top level", "<plist><array/></plist>", "the top level is not a dictionary"},
       {"no objects", "<plist><dict/></plist>", "\"Objects\" is missing or not an array"},
       {"no class", "<plist><dict><key>Objects</key><array><dict/></array></dict></plist>",
@@ -148,29 +139,20 @@ TEST_F(SimulatedDevicesTest, UnusableFileKeepsTheRegistryAndSaysWhy) {
        "object /#0: class KxUSBHostInterface does not derive from KxMedia"},
   };
   for (const auto& c : cases) {
+    SCOPED_TRACE(c.label);
     Write(c.text);
     log::CaptureSink capture;
     std::string error;
-    EXPECT_FALSE(devices.Reload(&error)) << c.label;
-    if (*c.reason) {
-      EXPECT_EQ(error, c.reason) << c.label;
-    }
-    EXPECT_TRUE(capture.Contains(Level::Default, "Failed to read devices file " + path + ": " + error))
-        << c.label;
-    EXPECT_EQ(model.ObjectCount(), published) << c.label;
-  }
-  unlink(path.c_str());
-  EXPECT_FALSE(devices.Reload());
-  EXPECT_EQ(model.ObjectCount(), published);
-}
-
-TEST_F(SimulatedDevicesTest, GoingAwayTakesItsObjectsAlong) {
-  Write(DevicesFile(true, true));
-  {
-    SimulatedDevices devices(model, path);
-    ASSERT_TRUE(devices.Reload());
+    EXPECT_FALSE(devices->Reload(&error));
+    EXPECT_EQ(error, c.reason);
+    EXPECT_TRUE(capture.Contains(Level::Default, "Failed to read devices file " + path + ": " + error));
     EXPECT_EQ(model.ObjectCount(), 5u);
   }
+  std::filesystem::remove(path);
+  EXPECT_FALSE(devices->Reload());
+  EXPECT_EQ(model.ObjectCount(), 5u);
+
+  devices.reset();
   EXPECT_EQ(model.ObjectCount(), 0u);
   model.Refresh(RefreshReason::HardwareEvent);  // no dangling provider
 }
