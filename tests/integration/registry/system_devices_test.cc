@@ -6,6 +6,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <string>
 
@@ -59,24 +60,17 @@ TEST_F(SystemDevicesTest, AttachedLoopDeviceIsPublishedBelowItsDriveAndTerminate
   ASSERT_NE(devices, nullptr);
   auto port = model.CreateNotificationPort().value;
   port->Attach(loop);
-  std::vector<ObjectRef> matched;
-  auto subscription = model.AddMatchingNotification(
-      *port, MatchKind::FirstMatch, Matching::Class("KxMedia"), [&](Iterator& it) {
-        while (ObjectRef object = it.Next()) matched.push_back(object);
-      });
-  while (subscription.value->Next()) {
-  }
+  std::vector<std::optional<plist::Value>> matched;  // BSD names
+  const auto collect = [&](Iterator& it) {
+    while (ObjectRef object = it.Next()) matched.push_back(object->Property("BSD Name"));
+  };
+  auto subscription = model.AddMatchingNotification(*port, MatchKind::FirstMatch, Matching::Class("KxMedia"), collect);
+  collect(*subscription.value);
 
   ASSERT_NO_FATAL_FAILURE(Attach(kIdentifier));
   // The kernel's event reaches the provider through the loop, and the new medium
   // reaches the subscriber through the port.
-  ASSERT_TRUE(loop.RunUntil(
-      [&] {
-        return std::any_of(matched.begin(), matched.end(), [&](const ObjectRef& object) {
-          return object->Property("BSD Name") == plist::Value(device.name());
-        });
-      },
-      5s));
+  ASSERT_TRUE(loop.RunUntil([&] { return std::ranges::count(matched, plist::Value(device.name())) == 1; }, 5s));
   ObjectRef media = MediaNamed(device.name());
   ASSERT_NE(media, nullptr);
   EXPECT_EQ(media->Property("Leaf"), plist::Value::Bool(true));
@@ -87,17 +81,13 @@ TEST_F(SystemDevicesTest, AttachedLoopDeviceIsPublishedBelowItsDriveAndTerminate
   auto drive = media->Parent();
   ASSERT_TRUE(drive.ok());
   EXPECT_TRUE(drive.value->ConformsTo("KxNimbrelHDDriveInKernel"));
-  EXPECT_EQ(drive.value->Property("image-path"),
-            plist::Value(plist::Bytes(image.begin(), image.end())));
+  EXPECT_EQ(drive.value->Property("image-path"), plist::Value(plist::Bytes(image.begin(), image.end())));
   EXPECT_EQ(SearchProperty(media, "nimbrel-unique-identifier"), plist::Value(kIdentifier));
 
-  struct stat node;
-  ASSERT_EQ(stat((devRoot + "/" + device.name()).c_str(), &node), 0)
-      << "the provider makes the missing node";
-  struct stat real;
+  struct stat node {}, real {};
+  ASSERT_EQ(stat((devRoot + "/" + device.name()).c_str(), &node), 0) << "the provider makes the missing node";
   ASSERT_EQ(stat(("/dev/" + device.name()).c_str(), &real), 0);
-  EXPECT_TRUE(S_ISBLK(node.st_mode));
-  EXPECT_EQ(node.st_rdev, real.st_rdev);
+  EXPECT_TRUE(S_ISBLK(node.st_mode) && node.st_rdev == real.st_rdev);
 
   std::vector<uint32_t> messages;
   auto removal = model.AddInterestNotification(
