@@ -127,8 +127,7 @@ TEST_F(DriversTest, LoopHelperAttachesReadOnlyWithItsNameAndDetachesWhenItGoes) 
       EXPECT_EQ(ReadText(sys + "/loop/partscan"), "1");
       EXPECT_EQ(ReadText(sys + "/loop/backing_file"), image);
       std::string identifier;
-      EXPECT_EQ(loop::ReadIdentifier(device.fd(), identifier), 0);
-      EXPECT_EQ(identifier, "helper-test");
+      EXPECT_TRUE(loop::ReadIdentifier(device.fd(), identifier) == 0 && identifier == "helper-test");
       EXPECT_FALSE(fs::exists(devRoot + "/" + device.name()));  // the node made for the open is gone
     }
     EXPECT_EQ(AttachedUnderDir(), 0);
@@ -148,9 +147,7 @@ TEST_F(DriversTest, AttachPublishesBeforeReturningAndRefusesWhatItDidNotVerify) 
   const std::string medium = MediumOf(kId1);
   ASSERT_FALSE(medium.empty());
   EXPECT_EQ(ReadText("/sys/block/" + medium + "/ro"), "1");
-  struct stat node {};
-  EXPECT_EQ(stat((devRoot + "/" + medium).c_str(), &node), 0);
-  EXPECT_TRUE(S_ISBLK(node.st_mode));
+  EXPECT_TRUE(fs::is_block_file(devRoot + "/" + medium));
 
   // Refusals: each with its line, none attaching anything.
   const std::string other = dir.str() + "/other.ext4", link = dir.str() + "/link", fifo = dir.str() + "/fifo";

@@ -63,8 +63,6 @@ std::vector<std::string> LeftBehind(const std::string& root) {
   return found;
 }
 
-enum class TrustCache { Real, Directory, Empty, Malformed };
-
 struct DiskImageTest : ::testing::Test {
   void SetUp() override {
     BRISVALE_REQUIRE_ROOT();
@@ -83,9 +81,10 @@ struct DiskImageTest : ::testing::Test {
     subscriber = notify::Subscriber::Create(daemon.Path("/private/var/run/vexa/notify"), &error);
     ASSERT_TRUE(subscriber) << error;
   }
-  // A new ext4 image outside the sandbox with a version file, a tool and a trust cache;
-  // or, with no version, bytes no kernel file system knows.
-  std::string BuildImage(const std::string& version = "21.4.5", TrustCache trustCache = TrustCache::Real) {
+  // A new ext4 image outside the sandbox with a version file, a tool and a trust cache
+  // (made by brisvale-imgtool unless given: "directory" or the file's bytes); or, with
+  // no version, bytes no kernel file system knows.
+  std::string BuildImage(const std::string& version = "21.4.5", std::optional<std::string> trustCache = {}) {
     const fs::path content = work / ("content" + std::to_string(++images));
     const std::string image = (work / ("image" + std::to_string(images) + ".img")).string();
     if (version.empty()) {
@@ -95,12 +94,9 @@ struct DiskImageTest : ::testing::Test {
     WriteVersion(content, version);
     WriteFile(content / "usr/bin/tool", "#!/bin/sh\necho " + std::to_string(images) + "\n");
     fs::permissions(content / "usr/bin/tool", fs::perms::owner_all);
-    if (trustCache == TrustCache::Real) {
-      EXPECT_TRUE(Imgtool({"trust-cache", content.string(), "-o", (content / ".TrustCache").string()}));
-    }
-    if (trustCache == TrustCache::Directory) fs::create_directories(content / ".TrustCache");
-    if (trustCache == TrustCache::Empty) WriteFile(content / ".TrustCache", "");
-    if (trustCache == TrustCache::Malformed) WriteFile(content / ".TrustCache", std::string(37, '\x01'));
+    if (!trustCache) EXPECT_TRUE(Imgtool({"trust-cache", content.string(), "-o", (content / ".TrustCache").string()}));
+    else if (*trustCache == "directory") fs::create_directories(content / ".TrustCache");
+    else WriteFile(content / ".TrustCache", *trustCache);
     std::string error;
     EXPECT_TRUE(MakeExt4Image(image, 4, content.string(), &error)) << error;
     return image;
@@ -219,16 +215,14 @@ TEST_F(DiskImageTest, RefusedImagesLeaveNothingAttachedOrMounted) {
   const struct {
     const char* name;
     std::string version;
-    TrustCache trustCache;
+    std::optional<std::string> trustCache;
     std::string line;
   } cases[] = {
-      {"version mismatch", "21.5", TrustCache::Real,
-       "System Version Mismatch for /Developer: (System: 21.4 / Image: 21.5)"},
-      {"trust cache a directory", "21.4.5", TrustCache::Directory, "Failed to load trust caches at /Developer."},
-      {"trust cache empty", "21.4.5", TrustCache::Empty, "Failed to load trust caches at /Developer."},
-      {"trust cache malformed", "21.4.5", TrustCache::Malformed, "Failed to load trust caches at /Developer."},
-      {"not a file system", "", TrustCache::Real,
-       "Failed to mount /private/var/run/staging/image.img at /Developer."},
+      {"version mismatch", "21.5", {}, "System Version Mismatch for /Developer: (System: 21.4 / Image: 21.5)"},
+      {"trust cache a directory", "21.4.5", "directory", "Failed to load trust caches at /Developer."},
+      {"trust cache empty", "21.4.5", "", "Failed to load trust caches at /Developer."},
+      {"trust cache malformed", "21.4.5", std::string(37, '\x01'), "Failed to load trust caches at /Developer."},
+      {"not a file system", "", {}, "Failed to mount /private/var/run/staging/image.img at /Developer."},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.name);
@@ -240,12 +234,9 @@ TEST_F(DiskImageTest, RefusedImagesLeaveNothingAttachedOrMounted) {
     EXPECT_THAT(Received(), IsEmpty());
   }
   EXPECT_TRUE(fs::is_directory(daemon.Path("/Developer")));
-}
 
-TEST_F(DiskImageTest, ImageOpenForWritingIsRefused) {
   // A writer holding the staged file open could rewrite it after the digest.
   const std::string image = BuildImage(), inside = "/private/var/run/staging/held.img";
-  fs::create_directories(daemon.Path("/private/var/run/staging"));
   fs::copy_file(image, daemon.Path(inside));
   const UniqueFd writer(::open(daemon.Path(inside).c_str(), O_WRONLY));
   EXPECT_EQ(Mount("Developer", image, Sign(image), inside), kFailure);
