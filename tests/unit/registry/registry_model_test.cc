@@ -193,14 +193,11 @@ TEST_F(RegistryModelTest, MatchedNotifiesObjectsThatComeToMatchAndPortsHoldUntil
 TEST_F(RegistryModelTest, TerminatedInterestReachesEveryWatchOfTheSubtreeOnce) {
   port->Attach(loop);
   Names terminated;
-  auto watch = [&](const ObjectRef& object) {
-    return std::move(model
-                         .AddInterestNotification(*port, object,
-                                                  [&](const ObjectRef& gone, uint32_t message) {
-                                                    if (message == kMessageServiceIsTerminated)
-                                                      terminated.push_back(gone->ClassName());
-                                                  })
-                         .value);
+  const auto record = [&](const ObjectRef& gone, uint32_t message) {
+    if (message == kMessageServiceIsTerminated) terminated.push_back(gone->ClassName());
+  };
+  const auto watch = [&](const ObjectRef& object) {
+    return std::move(model.AddInterestNotification(*port, object, record).value);
   };
   auto onPartition = watch(partition), onDisk = watch(disk), onCamera = watch(camera), ended = watch(usb);
   ended.reset();  // released before the removal: never called

@@ -30,22 +30,16 @@ std::string DevicesFile(bool withStick, bool withCamera, bool stickWritable = fa
   Dictionary removable{{"removable", Value::Bool(true)}};
   if (withStick) {
     Value data = Object("data", "KxMedia",
-                        {{"BSD Name", Value("disk9s1")},
-                         {"Leaf", Value::Bool(true)},
-                         {"Writable", Value::Bool(stickWritable)}});
-    Value disk = Object("disk", "KxMedia",
-                        {{"BSD Name", Value("disk9")}, {"Leaf", Value::Bool(false)}}, {data});
+                        {{"BSD Name", Value("disk9s1")}, {"Leaf", Value::Bool(true)}, {"Writable", Value::Bool(stickWritable)}});
+    Value disk = Object("disk", "KxMedia", {{"BSD Name", Value("disk9")}, {"Leaf", Value::Bool(false)}}, {data});
     objects.push_back(Object("stick", "KxUSBHostDevice", removable, {disk}));
   }
   if (withCamera) {
     Value chain(plist::Array{Value("KxUSBHostInterface"), Value("KxUSBInterface")});
-    Value ptp(Dictionary{{"Class", chain},
-                         {"Properties", Value(Dictionary{
-                                            {"bInterfaceClass", Value::Int(6)},
-                                            {"bInterfaceSubClass", Value::Int(1)},
-                                            {"bInterfaceProtocol", Value::Int(1)},
-                                        })}});
-    objects.push_back(Object("camera", "KxUSBHostDevice", removable, {ptp}));
+    const Dictionary ptp{
+        {"bInterfaceClass", Value::Int(6)}, {"bInterfaceSubClass", Value::Int(1)}, {"bInterfaceProtocol", Value::Int(1)}};
+    Value ptpInterface(Dictionary{{"Class", chain}, {"Properties", Value(ptp)}});
+    objects.push_back(Object("camera", "KxUSBHostDevice", removable, {ptpInterface}));
   }
   return plist::WriteXml(Value(Dictionary{{"Objects", Value(std::move(objects))}}));
 }
@@ -73,11 +67,8 @@ TEST_F(SimulatedDevicesTest, ReloadPublishesAddsAndTerminatesByPathInTheTree) {
   port->Attach(loop);
   std::vector<std::string> cameras;
   auto subscription = model.AddMatchingNotification(
-      *port, MatchKind::FirstMatch,
-      Matching::Class("KxUSBInterface").Set("bInterfaceClass", plist::Value::Int(6)),
-      [&](Iterator& it) {
-        while (ObjectRef object = it.Next()) cameras.push_back(object->ClassName());
-      });
+      *port, MatchKind::FirstMatch, Matching::Class("KxUSBInterface").Set("bInterfaceClass", plist::Value::Int(6)),
+      [&](Iterator& it) { while (ObjectRef object = it.Next()) cameras.push_back(object->ClassName()); });
   EXPECT_EQ(subscription.value->Next(), nullptr);
   std::vector<uint32_t> stickMessages;
   auto removal = model.AddInterestNotification(
@@ -92,8 +83,8 @@ TEST_F(SimulatedDevicesTest, ReloadPublishesAddsAndTerminatesByPathInTheTree) {
   EXPECT_EQ(cameras, std::vector<std::string>{"KxUSBHostInterface"});
   EXPECT_EQ(devices.Find({"stick", "disk", "data"}), data);
   EXPECT_EQ(data->Property("Writable"), plist::Value::Bool(true));
-  ASSERT_NE(devices.Find({"camera", "#0"}), nullptr);
-  EXPECT_TRUE(devices.Find({"camera", "#0"})->ConformsTo("KxUSBInterface"));
+  const ObjectRef ptp = devices.Find({"camera", "#0"});
+  EXPECT_TRUE(ptp && ptp->ConformsTo("KxUSBInterface"));
 
   // Pull the stick: its whole subtree goes, the camera stays.
   Write(DevicesFile(false, true));
