@@ -103,7 +103,8 @@ struct DiskImageTest : ::testing::Test {
   }
 
   std::string Sign(const std::string& image) {
-    EXPECT_TRUE(Imgtool({"sign-developer", "--key", kPki + "/developer-signing.key", "--image", image, "-o", image + ".sig"}));
+    const std::string key = kPki + "/developer-signing.key";
+    EXPECT_TRUE(Imgtool({"sign-developer", "--key", key, "--image", image, "-o", image + ".sig"}));
     return image + ".sig";
   }
 

@@ -125,9 +125,10 @@ class FileTreeOs : public FakeOs {
 // `digestLength` bytes.
 inline derwriter::Bytes ManifestOf(std::string_view subType, size_t digestLength = 48) {
   using namespace derwriter;
+  const Bytes name(subType.begin(), subType.end());
   return testing_support::DefaultManifest(ManifestBody(
       testing_support::DefaultManifestProperties(),
-      {{"pdmg", {DataProperty("DGST", Bytes(digestLength, 1)), DataProperty("pdnm", Bytes(subType.begin(), subType.end()))}}}));
+      {{"pdmg", {DataProperty("DGST", Bytes(digestLength, 1)), DataProperty("pdnm", name)}}}));
 }
 
 struct DiskImageTest : ::testing::Test {

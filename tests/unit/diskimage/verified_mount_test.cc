@@ -43,15 +43,6 @@ struct VerifiedMountTest : testing::DiskImageTest {
     return MountVerifiedImage(context, {kImage, type, signature, "/cert.pem", mountPath}, steps);
   }
 
-  // A mounted image staged below directories spelling the SHA-1 of "image".
-  void MountImageAt(const std::string& mountPath, const std::string& bsdName) {
-    const std::string backing = "/stage/0E76292794/888D4F1FA75FB3AFF4CA27C58F56A6/x.img";
-    auto drive = registry.Publish(nullptr, "KxNimbrelHDDriveInKernel",
-                                  {{"image-path", plist::Value(plist::Bytes(backing.begin(), backing.end()))}});
-    registry.Publish(drive, "KxMedia", Medium(bsdName));
-    os.mounts.push_back({os::kMountReadOnly, "ext4", mountPath, "/dev/" + bsdName});
-  }
-
   MountSteps steps;
   int signatureResult = 0, trustCacheResult = 0;
   std::optional<std::string> attachResult = "/dev/loop7";
@@ -114,7 +105,12 @@ TEST_F(VerifiedMountTest, EachStepEndsTheAttemptWithItsLineUndoesWhatItMadeAndCo
 }
 
 TEST_F(VerifiedMountTest, DigestComesFromTheVerifiedDescriptorAndFindsAnIdenticalImage) {
-  MountImageAt("/private/var/factory_mount/abc", "loop4");
+  // A mounted image staged below directories spelling the SHA-1 of "image".
+  const std::string backing = "/stage/0E76292794/888D4F1FA75FB3AFF4CA27C58F56A6/x.img";
+  const auto drive = registry.Publish(nullptr, "KxNimbrelHDDriveInKernel",
+                                      {{"image-path", plist::Value(plist::Bytes(backing.begin(), backing.end()))}});
+  registry.Publish(drive, "KxMedia", Medium("loop4"));
+  os.mounts.push_back({os::kMountReadOnly, "ext4", "/private/var/factory_mount/abc", "/dev/loop4"});
   os.AddFile(kImage, kFile);
   const VerifiedMountResult result = Mount("Factory", "/private/var/factory_mount/new");
   EXPECT_FALSE(result.deviceNode);
@@ -131,25 +127,21 @@ TEST_F(VerifiedMountTest, DigestComesFromTheVerifiedDescriptorAndFindsAnIdentica
 }
 
 // A controller that attaches whatever it is asked to and publishes its media at once.
-class FakeController : public registry::UserClient {
- public:
+struct FakeController : registry::UserClient {
   FakeController(registry::RegistryModel& registry, std::vector<plist::Dictionary>& requests)
-      : registry_(registry), requests_(requests) {}
+      : registry(registry), requests(requests) {}
   registry::Status CallMethod(uint32_t, registry::MethodArgs& args) override {
-    uint64_t address = 0, length = 0;
-    std::memcpy(&address, args.structIn.data() + 8, 8);
-    std::memcpy(&length, args.structIn.data() + 16, 8);
-    const auto request = plist::ReadXml({reinterpret_cast<const uint8_t*>(address), length});
-    requests_.push_back(*request->dictionary());
-    auto drive = registry_.Publish(nullptr, "KxNimbrelHDDriveInKernel",
-                                   {{"nimbrel-unique-identifier", *request->get("nimbrel-unique-identifier")}});
-    registry_.Publish(drive, "KxMedia", Medium("loop" + std::to_string(requests_.size())));
+    uint64_t location[2] = {};  // address, length
+    std::memcpy(location, args.structIn.data() + 8, sizeof location);
+    const auto request = plist::ReadXml({reinterpret_cast<const uint8_t*>(location[0]), location[1]});
+    requests.push_back(*request->dictionary());
+    auto drive = registry.Publish(nullptr, "KxNimbrelHDDriveInKernel",
+                                  {{"nimbrel-unique-identifier", *request->get("nimbrel-unique-identifier")}});
+    registry.Publish(drive, "KxMedia", Medium("loop" + std::to_string(requests.size())));
     return registry::kSuccess;
   }
-
- private:
-  registry::RegistryModel& registry_;
-  std::vector<plist::Dictionary>& requests_;
+  registry::RegistryModel& registry;
+  std::vector<plist::Dictionary>& requests;
 };
 
 TEST_F(VerifiedMountTest, AttachCarriesTheVerifiedIdentityAndStopsWhenTheLeaseWasBroken) {

@@ -26,15 +26,16 @@ std::string DevicesFile(bool withStick, bool withCamera, bool stickWritable = fa
   plist::Array objects;
   Dictionary removable{{"removable", Value::Bool(true)}};
   if (withStick) {
-    Value data = Object("data", "KxMedia",
-                        {{"BSD Name", Value("disk9s1")}, {"Leaf", Value::Bool(true)}, {"Writable", Value::Bool(stickWritable)}});
+    const Dictionary partition{
+        {"BSD Name", Value("disk9s1")}, {"Leaf", Value::Bool(true)}, {"Writable", Value::Bool(stickWritable)}};
+    Value data = Object("data", "KxMedia", partition);
     Value disk = Object("disk", "KxMedia", {{"BSD Name", Value("disk9")}, {"Leaf", Value::Bool(false)}}, {data});
     objects.push_back(Object("stick", "KxUSBHostDevice", removable, {disk}));
   }
   if (withCamera) {
     Value chain(plist::Array{Value("KxUSBHostInterface"), Value("KxUSBInterface")});
-    const Dictionary ptp{
-        {"bInterfaceClass", Value::Int(6)}, {"bInterfaceSubClass", Value::Int(1)}, {"bInterfaceProtocol", Value::Int(1)}};
+    const Dictionary ptp{{"bInterfaceClass", Value::Int(6)}, {"bInterfaceSubClass", Value::Int(1)},
+                         {"bInterfaceProtocol", Value::Int(1)}};
     Value ptpInterface(Dictionary{{"Class", chain}, {"Properties", Value(ptp)}});
     objects.push_back(Object("camera", "KxUSBHostDevice", removable, {ptpInterface}));
   }
