@@ -1,6 +1,8 @@
 // Verified disk images through the real daemon in a sandbox root: images built with
 // mkfs.ext4 and signed with brisvale-imgtool at test time, real loop devices and mounts.
 #include <fcntl.h>
+#include <linux/loop.h>
+#include <sys/ioctl.h>
 #include <sys/statvfs.h>
 
 #include <gmock/gmock.h>
@@ -146,6 +148,18 @@ struct DiskImageTest : ::testing::Test {
   int images = 0;
 };
 
+// Detaches at the end of the test a loop device still backed by a file below `root`: the
+// stand-in for a killed daemon's device must not outlive a test the daemon failed.
+struct AbandonedDevice {
+  std::string name, root;
+  ~AbandonedDevice() {
+    std::string backing;
+    std::getline(std::ifstream("/sys/block/" + name + "/loop/backing_file"), backing);
+    const UniqueFd fd(backing.starts_with(root + "/") ? ::open(("/dev/" + name).c_str(), O_RDONLY | O_CLOEXEC) : -1);
+    if (fd) ::ioctl(fd.get(), LOOP_CLR_FD, 0);
+  }
+};
+
 plist::Value Success(const std::string& mountPath) {
   return plist::Dictionary{{"Status", "Success"}, {"MountPath", plist::Value(mountPath)}};
 }
@@ -249,6 +263,7 @@ TEST_F(DiskImageTest, ImageDeviceOfADaemonKilledMidMountIsDetachedOnRestart) {
   options.deviceRoot = daemon.Path("/dev");
   loop::LoopDevice device;
   ASSERT_EQ(loop::Attach(file.get(), options, device), 0);
+  const AbandonedDevice abandoned{device.name(), daemon.root()};
   device.Release();
   ASSERT_EQ(LeftBehind(daemon.root()).size(), 1u);
   daemon.Stop();
