@@ -1,10 +1,11 @@
-// The loop-device helper and the disk-image controller over real files, loop devices
-// and mounts, and the start-up clean-up of the devices a killed daemon left attached.
-// Needs root; every test skips otherwise.
+// The loop-device helper, the disk-image controller, the code-integrity service and the
+// image volume mount over real files, loop devices and mounts, and the start-up clean-up
+// of the devices a killed daemon left attached. Needs root; every test skips otherwise.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <sys/sysmacros.h>
 
 #include <cstring>
@@ -14,11 +15,16 @@
 #include "base/log.h"
 #include "base/plist.h"
 #include "base/unique_fd.h"
+#include "diskimage/trust_cache.h"
+#include "diskimage/volume_mount.h"
 #include "loop_mount.h"
 #include "platform/linux/format_attach_request.h"
+#include "platform/linux/format_trust_cache.h"
 #include "platform/linux/loop_device.h"
 #include "platform/linux/registry_disk_images.h"
 #include "platform/linux/system_devices.h"
+#include "platform/os.h"
+#include "platform/services.h"
 #include "test_files.h"
 
 namespace brisvale::registry {
@@ -183,6 +189,45 @@ TEST_F(DriversTest, AttachPublishesBeforeReturningAndRefusesWhatItDidNotVerify) 
   fs::create_hard_link(image, dir.str() + "/second-name");
   EXPECT_EQ(Attach(list), 0xe00002e2);
   EXPECT_EQ(AttachedUnderDir(), 1);
+}
+
+TEST_F(DriversTest, TrustCachesAreKeptOrRefusedVolumesMountReadOnlyAndAMismatchUndoesAll) {
+  ScopedServices scoped(Services{&model, &os::SystemOs(), nullptr, nullptr});
+  // Malformed, empty and a directory are refused; only the well-formed one is kept.
+  const std::string cachePath = owner.mountPoint + "/.TrustCache", keptDir = dir.str() + "/trust-caches";
+  formats::TrustCacheEntry entry;
+  entry.hash.fill(7);
+  const std::vector<uint8_t> wellFormed = formats::BuildTrustCache({entry});
+  for (const char* contents : std::initializer_list<const char*>{"BVTC", "", nullptr}) {
+    fs::remove_all(cachePath);
+    if (contents) std::ofstream(cachePath) << contents;
+    if (!contents) fs::create_directory(cachePath);
+    EXPECT_EQ(LoadTrustCache(owner.mountPoint), -1) << (contents ? contents : "directory");
+  }
+  fs::remove_all(cachePath);
+  brisvale::testing::WriteFileBytes(cachePath, wellFormed);
+  EXPECT_EQ(LoadTrustCache(owner.mountPoint), 0);
+  ASSERT_EQ(std::distance(fs::directory_iterator(keptDir), fs::directory_iterator()), 1);
+  EXPECT_EQ(brisvale::testing::ReadFileBytes(fs::directory_iterator(keptDir)->path()), wellFormed);
+
+  // Read-only, without set-user-ID programs or device nodes.
+  ASSERT_EQ(Attach(List(kId1, image)), kSuccess);
+  const std::string medium = MediumOf(kId1);
+  ASSERT_FALSE(medium.empty());
+  os::VolumeMountArguments arguments;
+  arguments.devicePath = "/dev/" + medium;
+  ASSERT_EQ(os::SystemOs().MountVolume("hfs", owner.mountPoint.c_str(), os::kMountReadOnly, arguments), 0);
+  struct statvfs volume {};
+  ASSERT_EQ(statvfs(owner.mountPoint.c_str(), &volume), 0);
+  EXPECT_EQ(volume.f_flag & (ST_RDONLY | ST_NOSUID | ST_NODEV), ST_RDONLY | ST_NOSUID | ST_NODEV);
+  ASSERT_EQ(umount2(owner.mountPoint.c_str(), 0), 0);
+
+  // The host has no system version file, so the check fails and everything goes again.
+  log::CaptureSink capture;
+  EXPECT_EQ(MountImageVolume(medium, owner.mountPoint), std::nullopt);
+  EXPECT_EQ(capture.Texts().back(), "System version verification failed for " + owner.mountPoint + ".");
+  EXPECT_TRUE(fs::exists(cachePath)) << "still mounted over";
+  EXPECT_EQ(AttachedUnderDir(), 0);
 }
 
 TEST_F(DriversTest, StartUpDetachesOnlyUnmountedImageDevicesOfItsRoot) {
