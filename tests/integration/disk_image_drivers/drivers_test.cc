@@ -1,16 +1,16 @@
-// The loop-device helper, the disk-image controller and the code-integrity service
-// over real files, loop devices and mounts. Needs root; every test skips otherwise.
+// The loop-device helper, the disk-image controller, the code-integrity service and the
+// image volume mount over real files, loop devices and mounts, and the start-up clean-up
+// of the devices a killed daemon left attached. Needs root; every test skips otherwise.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <sys/sysmacros.h>
-#include <unistd.h>
 
 #include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 
 #include "base/log.h"
 #include "base/plist.h"
@@ -22,103 +22,56 @@
 #include "platform/linux/format_trust_cache.h"
 #include "platform/linux/loop_device.h"
 #include "platform/linux/registry_disk_images.h"
+#include "platform/linux/system_devices.h"
 #include "platform/os.h"
 #include "platform/services.h"
-#include "platform/linux/system_devices.h"
+#include "test_files.h"
 
 namespace brisvale::registry {
 namespace {
 
 namespace fs = std::filesystem;
 
-#define SKIP_UNLESS_ROOT() \
-  if (geteuid() != 0) GTEST_SKIP() << "needs root (loop devices, mknod, mount)"
-
+// The first line of a sysfs attribute.
 std::string ReadText(const std::string& path) {
-  std::ifstream in(path);
-  std::stringstream text;
-  text << in.rdbuf();
-  std::string value = text.str();
-  while (!value.empty() && value.back() == '\n') value.pop_back();
-  return value;
+  std::string line;
+  std::getline(std::ifstream(path), line);
+  return line;
 }
+
+// Unmounts what a test mounted at `mountPoint` and detaches the image devices the
+// controller attached below `dir` when the test ends, however it ends.
+struct ImageDevicesOwner {
+  std::string dir, mountPoint;
+  ~ImageDevicesOwner() {
+    umount2(mountPoint.c_str(), MNT_DETACH);
+    DetachAbandonedImageDevices(dir);
+  }
+};
 
 class DriversTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    SKIP_UNLESS_ROOT();
-    char name[] = "/tmp/brisvale-drivers-XXXXXX";
-    ASSERT_NE(mkdtemp(name), nullptr);
-    dir = name;
-    devRoot = dir + "/dev";
+    BRISVALE_REQUIRE_ROOT();
     fs::create_directories(devRoot);
-    fs::create_directories(dir + "/mnt");
+    fs::create_directories(owner.mountPoint);
     // The device root holds loop-control only: the loop nodes are made on demand.
     ASSERT_EQ(mknod((devRoot + "/loop-control").c_str(), S_IFCHR | 0600, makedev(10, 237)), 0);
-    image = dir + "/image.ext4";
     std::string error;
-    ASSERT_TRUE(testing::MakeExt4Image(image, 4, "", &error)) << error;
-  }
-  void TearDown() override {
-    if (dir.empty()) return;
-    umount2((dir + "/mnt").c_str(), MNT_DETACH);
-    DetachAbandonedImageDevices(dir);
-    EXPECT_EQ(AttachedUnderDir(), 0) << "loop devices left attached";
-    std::error_code ignored;
-    fs::remove_all(dir, ignored);
+    ASSERT_TRUE(brisvale::testing::MakeExt4Image(image, 4, "", &error)) << error;
+    devices = StartSystemDevices(model, nullptr, {devRoot});
+    ASSERT_NE(devices, nullptr);
+    services.emplace(model, DiskImageServicesOptions{devRoot, dir.str() + "/trust-caches",
+                                                     [this] { devices->Rescan(); }});
   }
 
   // Loop devices whose backing file lies in this test's directory.
   int AttachedUnderDir() const {
     int count = 0;
     for (const auto& entry : fs::directory_iterator("/sys/block")) {
-      if (ReadText(entry.path().string() + "/loop/backing_file").starts_with(dir + "/")) ++count;
+      if (ReadText(entry.path().string() + "/loop/backing_file").starts_with(dir.str() + "/")) ++count;
     }
     return count;
-  }
-
-  std::string dir, devRoot, image;
-};
-
-TEST_F(DriversTest, LoopHelperAttachesReadOnlyWithItsNameAndDetachesWhenItGoes) {
-  for (const bool legacy : {false, true}) {
-    SCOPED_TRACE(legacy ? "LOOP_SET_FD" : "LOOP_CONFIGURE");
-    const UniqueFd file(open(image.c_str(), O_RDONLY | O_CLOEXEC));
-    loop::AttachOptions options;
-    options.partitionScan = true;
-    options.identifier = "helper-test";
-    options.deviceRoot = devRoot;
-    options.legacyAttach = legacy;
-    {
-      loop::LoopDevice device;
-      ASSERT_EQ(loop::Attach(file.get(), options, device), 0);
-      const std::string sys = "/sys/block/" + device.name();
-      EXPECT_EQ(ReadText(sys + "/ro"), "1");
-      EXPECT_EQ(ReadText(sys + "/loop/partscan"), "1");
-      EXPECT_EQ(ReadText(sys + "/loop/backing_file"), image);
-      std::string identifier;
-      EXPECT_EQ(loop::ReadIdentifier(device.fd(), identifier), 0);
-      EXPECT_EQ(identifier, "helper-test");
-      EXPECT_FALSE(fs::exists(devRoot + "/" + device.name()));  // the node made for the open is gone
-    }
-    EXPECT_EQ(AttachedUnderDir(), 0);
-  }
-}
-
-class ControllerTest : public DriversTest {
- protected:
-  void SetUp() override {
-    DriversTest::SetUp();
-    if (dir.empty()) return;
-    devices = StartSystemDevices(model, nullptr, {devRoot});
-    ASSERT_NE(devices, nullptr);
-    services.emplace(model, DiskImageServicesOptions{devRoot, dir + "/trust-caches",
-                                                     [this] { devices->Rescan(); }});
-  }
-  void TearDown() override {
-    services.reset();
-    devices.reset();
-    DriversTest::TearDown();
   }
 
   // Calls the controller's attach method the way the daemon does, with a record that
@@ -155,15 +108,42 @@ class ControllerTest : public DriversTest {
     return name;
   }
 
+  brisvale::testing::ScratchDir dir;
+  const std::string devRoot = dir.str() + "/dev", image = dir.str() + "/image.ext4";
+  ImageDevicesOwner owner{dir.str(), dir.str() + "/mnt"};
   RegistryModel model;
   std::unique_ptr<SystemDevices> devices;
   std::optional<DiskImageServices> services;
 };
 
+TEST_F(DriversTest, LoopHelperAttachesReadOnlyWithItsNameAndDetachesWhenItGoes) {
+  for (const bool legacy : {false, true}) {
+    SCOPED_TRACE(legacy ? "LOOP_SET_FD" : "LOOP_CONFIGURE");
+    const UniqueFd file(open(image.c_str(), O_RDONLY | O_CLOEXEC));
+    loop::AttachOptions options;
+    options.partitionScan = true;
+    options.identifier = "helper-test";
+    options.deviceRoot = devRoot;
+    options.legacyAttach = legacy;
+    {
+      loop::LoopDevice device;
+      ASSERT_EQ(loop::Attach(file.get(), options, device), 0);
+      const std::string sys = "/sys/block/" + device.name();
+      EXPECT_EQ(ReadText(sys + "/ro"), "1");
+      EXPECT_EQ(ReadText(sys + "/loop/partscan"), "1");
+      EXPECT_EQ(ReadText(sys + "/loop/backing_file"), image);
+      std::string identifier;
+      EXPECT_TRUE(loop::ReadIdentifier(device.fd(), identifier) == 0 && identifier == "helper-test");
+      EXPECT_FALSE(fs::exists(devRoot + "/" + device.name()));  // the node made for the open is gone
+    }
+    EXPECT_EQ(AttachedUnderDir(), 0);
+  }
+}
+
 constexpr const char* kId1 = "0F3C2B1A-9D8E-4F7A-B6C5-D4E3F2A1B0C9";
 constexpr const char* kId2 = "1A2B3C4D-5E6F-4071-8293-A4B5C6D7E8F9";
 
-TEST_F(ControllerTest, AttachPublishesBeforeReturningAndRefusesWhatItDidNotVerify) {
+TEST_F(DriversTest, AttachPublishesBeforeReturningAndRefusesWhatItDidNotVerify) {
   struct stat verified {};
   ASSERT_EQ(stat(image.c_str(), &verified), 0);
   plist::Dictionary list = List(kId1, image);
@@ -173,12 +153,10 @@ TEST_F(ControllerTest, AttachPublishesBeforeReturningAndRefusesWhatItDidNotVerif
   const std::string medium = MediumOf(kId1);
   ASSERT_FALSE(medium.empty());
   EXPECT_EQ(ReadText("/sys/block/" + medium + "/ro"), "1");
-  struct stat node {};
-  EXPECT_EQ(stat((devRoot + "/" + medium).c_str(), &node), 0);
-  EXPECT_TRUE(S_ISBLK(node.st_mode));
+  EXPECT_TRUE(fs::is_block_file(devRoot + "/" + medium));
 
   // Refusals: each with its line, none attaching anything.
-  const std::string other = dir + "/other.ext4", link = dir + "/link", fifo = dir + "/fifo";
+  const std::string other = dir.str() + "/other.ext4", link = dir.str() + "/link", fifo = dir.str() + "/fifo";
   fs::copy_file(image, other);
   fs::create_symlink(image, link);
   ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
@@ -193,7 +171,7 @@ TEST_F(ControllerTest, AttachPublishesBeforeReturningAndRefusesWhatItDidNotVerif
       {swapped, {}, 0xe00002e2, "Disk image " + other + " is not the file that was verified."},
       {List(kId2, link), {}, kNotFound, "Failed to open disk image " + link + ": 40"},
       {List(kId2, fifo), {}, kBadArgument, "Disk image " + fifo + " is not a regular file."},
-      {List(kId2, dir), {}, kBadArgument, "Disk image " + dir + " is not a regular file."},
+      {List(kId2, dir.str()), {}, kBadArgument, "Disk image " + dir.str() + " is not a regular file."},
       {List(kId2, "image.ext4"), {}, kBadArgument, "Disk image attach refused: bad image path."},
       {List("not-a-uuid", image), {}, kBadArgument, "Disk image attach refused: bad identifier."},
       {List(kId2, image), [](auto& record) { std::memset(record.data() + 16, 0, 8); }, kBadArgument,
@@ -208,65 +186,59 @@ TEST_F(ControllerTest, AttachPublishesBeforeReturningAndRefusesWhatItDidNotVerif
     EXPECT_EQ(capture.Texts(), std::vector{c.line});
   }
   // A second name for the verified file would let it be rewritten: refused too.
-  fs::create_hard_link(image, dir + "/second-name");
+  fs::create_hard_link(image, dir.str() + "/second-name");
   EXPECT_EQ(Attach(list), 0xe00002e2);
   EXPECT_EQ(AttachedUnderDir(), 1);
 }
 
-TEST_F(ControllerTest, VolumeMountsReadOnlyAndAVersionMismatchUndoesMountAndAttach) {
+TEST_F(DriversTest, TrustCachesAreKeptOrRefusedVolumesMountReadOnlyAndAMismatchUndoesAll) {
   ScopedServices scoped(Services{&model, &os::SystemOs(), nullptr, nullptr});
+  // Malformed, empty and a directory are refused; only the well-formed one is kept.
+  const std::string cachePath = owner.mountPoint + "/.TrustCache", keptDir = dir.str() + "/trust-caches";
+  formats::TrustCacheEntry entry;
+  entry.hash.fill(7);
+  const std::vector<uint8_t> wellFormed = formats::BuildTrustCache({entry});
+  for (const char* contents : std::initializer_list<const char*>{"BVTC", "", nullptr}) {
+    fs::remove_all(cachePath);
+    if (contents) std::ofstream(cachePath) << contents;
+    if (!contents) fs::create_directory(cachePath);
+    EXPECT_EQ(LoadTrustCache(owner.mountPoint), -1) << (contents ? contents : "directory");
+  }
+  fs::remove_all(cachePath);
+  brisvale::testing::WriteFileBytes(cachePath, wellFormed);
+  EXPECT_EQ(LoadTrustCache(owner.mountPoint), 0);
+  ASSERT_EQ(std::distance(fs::directory_iterator(keptDir), fs::directory_iterator()), 1);
+  EXPECT_EQ(brisvale::testing::ReadFileBytes(fs::directory_iterator(keptDir)->path()), wellFormed);
+
+  // Read-only, without set-user-ID programs or device nodes.
   ASSERT_EQ(Attach(List(kId1, image)), kSuccess);
-  const std::string medium = MediumOf(kId1), mountPoint = dir + "/mnt";
+  const std::string medium = MediumOf(kId1);
   ASSERT_FALSE(medium.empty());
   os::VolumeMountArguments arguments;
   arguments.devicePath = "/dev/" + medium;
-  ASSERT_EQ(os::SystemOs().MountVolume("hfs", mountPoint.c_str(), os::kMountReadOnly, arguments), 0);
-  const std::string table = ReadText("/proc/self/mountinfo");
-  const size_t line = table.find(" " + mountPoint + " ");
-  ASSERT_NE(line, std::string::npos);
-  EXPECT_EQ(table.substr(line + mountPoint.size() + 2, 15), "ro,nosuid,nodev");
-  ASSERT_EQ(umount2(mountPoint.c_str(), 0), 0);
+  ASSERT_EQ(os::SystemOs().MountVolume("hfs", owner.mountPoint.c_str(), os::kMountReadOnly, arguments), 0);
+  struct statvfs volume {};
+  ASSERT_EQ(statvfs(owner.mountPoint.c_str(), &volume), 0);
+  EXPECT_EQ(volume.f_flag & (ST_RDONLY | ST_NOSUID | ST_NODEV), ST_RDONLY | ST_NOSUID | ST_NODEV);
+  ASSERT_EQ(umount2(owner.mountPoint.c_str(), 0), 0);
 
   // The host has no system version file, so the check fails and everything goes again.
   log::CaptureSink capture;
-  EXPECT_EQ(MountImageVolume(medium, mountPoint), std::nullopt);
-  EXPECT_EQ(capture.Texts().back(), "System version verification failed for " + mountPoint + ".");
-  EXPECT_EQ(ReadText("/proc/self/mountinfo").find(" " + mountPoint + " "), std::string::npos);
+  EXPECT_EQ(MountImageVolume(medium, owner.mountPoint), std::nullopt);
+  EXPECT_EQ(capture.Texts().back(), "System version verification failed for " + owner.mountPoint + ".");
+  EXPECT_TRUE(fs::exists(cachePath)) << "still mounted over";
   EXPECT_EQ(AttachedUnderDir(), 0);
 }
 
-TEST_F(ControllerTest, TrustCachesAreKeptOrRefused) {
-  ScopedServices scoped(Services{&model, &os::SystemOs(), nullptr, nullptr});
-  const std::string volume = dir + "/mnt", cachePath = volume + "/.TrustCache";
-  formats::TrustCacheEntry entry;
-  entry.hash.fill(7);
-  const std::vector<uint8_t> cache = formats::BuildTrustCache({entry});
-  const std::string wellFormed(cache.begin(), cache.end());
-  // Malformed, empty and a directory are refused; only the well-formed one is kept.
-  for (const char* contents : std::initializer_list<const char*>{"BVTC", "", nullptr}) {
-    std::error_code ignored;
-    fs::remove_all(cachePath, ignored);
-    if (contents) std::ofstream(cachePath) << contents;
-    if (!contents) fs::create_directory(cachePath);
-    EXPECT_EQ(LoadTrustCache(volume), -1) << (contents ? contents : "directory");
-  }
-  fs::remove_all(cachePath);
-  std::ofstream(cachePath) << wellFormed;
-  EXPECT_EQ(LoadTrustCache(volume), 0);
-  const auto kept = fs::directory_iterator(dir + "/trust-caches");
-  ASSERT_EQ(std::distance(fs::begin(kept), fs::end(kept)), 1);
-  EXPECT_EQ(ReadText(fs::directory_iterator(dir + "/trust-caches")->path()), wellFormed);
-}
-
-TEST_F(ControllerTest, StartUpDetachesOnlyUnmountedImageDevicesOfItsRoot) {
-  const std::string second = dir + "/second.ext4";
+TEST_F(DriversTest, StartUpDetachesOnlyUnmountedImageDevicesOfItsRoot) {
+  const std::string second = dir.str() + "/second.ext4";
   fs::copy_file(image, second);
   ASSERT_EQ(Attach(List(kId1, image)), kSuccess);
   ASSERT_EQ(Attach(List(kId2, second)), kSuccess);
   const std::string mounted = MediumOf(kId1);
-  ASSERT_EQ(mount(("/dev/" + mounted).c_str(), (dir + "/mnt").c_str(), "ext4", MS_RDONLY, nullptr), 0);
-  EXPECT_EQ(DetachAbandonedImageDevices(dir + "/elsewhere"), 0);
-  EXPECT_EQ(DetachAbandonedImageDevices(dir), 1);
+  ASSERT_EQ(mount(("/dev/" + mounted).c_str(), owner.mountPoint.c_str(), "ext4", MS_RDONLY, nullptr), 0);
+  EXPECT_EQ(DetachAbandonedImageDevices(dir.str() + "/elsewhere"), 0);
+  EXPECT_EQ(DetachAbandonedImageDevices(dir.str()), 1);
   EXPECT_EQ(AttachedUnderDir(), 1);
   EXPECT_EQ(ReadText("/sys/block/" + mounted + "/loop/backing_file"), image);
 }

@@ -1,13 +1,9 @@
 // Mount locations by type and sub-type, the mount-directory check and the path check,
 // over a file table.
-#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "base/log.h"
 #include "diskimage/mount_locations.h"
-#include "file_tree_os.h"
-#include "platform/services.h"
-#include "qor4_test_support.h"
+#include "disk_image_fixture.h"
 
 namespace brisvale {
 namespace {
@@ -15,19 +11,7 @@ namespace {
 using testing::kDirectory;
 using testing::kFile;
 using testing::kLink;
-
-derwriter::Bytes ManifestOfSubType(std::string_view subType) {
-  using namespace derwriter;
-  return testing_support::DefaultManifest(
-      ManifestBody(testing_support::DefaultManifestProperties(),
-                   {{"pdmg", {DataProperty("DGST", Bytes(48, 1)), DataProperty("pdnm", Bytes(subType.begin(), subType.end()))}}}));
-}
-
-struct MountLocationsTest : ::testing::Test {
-  testing::FileTreeOs os;
-  log::CaptureSink capture;
-  ScopedServices services{Services{nullptr, &os, nullptr, nullptr}};
-};
+using MountLocationsTest = testing::DiskImageTest;
 
 TEST_F(MountLocationsTest, TypeAndSubTypeDecideDirectoryAndNotification) {
   os.mkdirErrors["/private/var/personalized_demo"] = -EACCES;
@@ -56,7 +40,7 @@ TEST_F(MountLocationsTest, TypeAndSubTypeDecideDirectoryAndNotification) {
     capture.Clear();
     const derwriter::Bytes manifest = c.subType == "-"  ? derwriter::Bytes{0x30, 0x03, 1}
                                       : c.subType.empty() ? derwriter::Bytes{}
-                                                          : ManifestOfSubType(c.subType);
+                                                          : testing::ManifestOf(c.subType);
     const std::optional<MountLocation> location = ResolveMountLocation(c.type, manifest);
     if (c.mountPath.empty()) {
       EXPECT_FALSE(location);

@@ -3,13 +3,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "base/log.h"
 #include "diskimage/attach.h"
 #include "diskimage/verified_mount.h"
-#include "file_tree_os.h"
-#include "platform/services.h"
-#include "qor4_test_support.h"
-#include "registry/registry_model.h"
+#include "disk_image_fixture.h"
 
 namespace brisvale {
 namespace {
@@ -21,19 +17,12 @@ using testing::kLink;
 
 constexpr const char* kImage = "/private/var/stage/image.img";
 
-derwriter::Bytes ManifestWithDigestLength(size_t length) {
-  using namespace derwriter;
-  return testing_support::DefaultManifest(
-      ManifestBody(testing_support::DefaultManifestProperties(),
-                   {{"pdmg", {DataProperty("DGST", Bytes(length, 1)), DataProperty("pdnm", Bytes{'D'})}}}));
-}
-
 plist::Dictionary Medium(const std::string& bsdName) {
   return {{"BSD Name", plist::Value(bsdName)}, {"Content", ""}, {"Removable", plist::Value::Bool(false)},
           {"Leaf", plist::Value::Bool(true)}};
 }
 
-struct VerifiedMountTest : ::testing::Test {
+struct VerifiedMountTest : testing::DiskImageTest {
   VerifiedMountTest() {
     for (const char* dir : {"/", "/private", "/private/var", "/private/var/stage", "/Developer",
                             "/private/var/personalized_debug"}) {
@@ -54,19 +43,6 @@ struct VerifiedMountTest : ::testing::Test {
     return MountVerifiedImage(context, {kImage, type, signature, "/cert.pem", mountPath}, steps);
   }
 
-  // A mounted image staged below directories spelling the SHA-1 of "image".
-  void MountImageAt(const std::string& mountPath, const std::string& bsdName) {
-    const std::string backing = "/stage/0E76292794/888D4F1FA75FB3AFF4CA27C58F56A6/x.img";
-    auto drive = registry.Publish(nullptr, "KxNimbrelHDDriveInKernel",
-                                  {{"image-path", plist::Value(plist::Bytes(backing.begin(), backing.end()))}});
-    registry.Publish(drive, "KxMedia", Medium(bsdName));
-    os.mounts.push_back({os::kMountReadOnly, "ext4", mountPath, "/dev/" + bsdName});
-  }
-
-  testing::FileTreeOs os;
-  registry::RegistryModel registry;
-  log::CaptureSink capture;
-  ScopedServices services{Services{&registry, &os, nullptr, nullptr}};
   MountSteps steps;
   int signatureResult = 0, trustCacheResult = 0;
   std::optional<std::string> attachResult = "/dev/loop7";
@@ -74,11 +50,13 @@ struct VerifiedMountTest : ::testing::Test {
 
 TEST_F(VerifiedMountTest, EachStepEndsTheAttemptWithItsLineUndoesWhatItMadeAndConsumesTheImage) {
   const std::string unlink = std::string("unlink ") + kImage, open = std::string("open-image ") + kImage;
+  const derwriter::Bytes manifest = testing::ManifestOf("DebugDiskImage");
   struct Case {
     const char* name;
     std::function<void(VerifiedMountTest&)> arrange;
     std::vector<std::string> lines, calls;
     std::string mountPath = "/Developer";
+    const char* type = "Developer";
   };
   const std::vector<Case> cases = {
       {"missing", [](auto& t) { t.os.files.erase(kImage); },
@@ -93,6 +71,9 @@ TEST_F(VerifiedMountTest, EachStepEndsTheAttemptWithItsLineUndoesWhatItMadeAndCo
        {"Failed to take a read lease on /private/var/stage/image.img: 11"}, {open, unlink}},
       {"bad signature", [](auto& t) { t.signatureResult = -1; },
        {"Failed to verify the disk image signature."}, {open, unlink}},
+      {"ticket refused", [](auto& t) { t.signatureResult = -1; },
+       {"Failed to validate server ticket with this device/image"}, {open, unlink},
+       "/private/var/personalized_debug", "Personalized"},
       {"mount point not empty", [](auto& t) { t.os.AddFile("/Developer/stray", kFile); },
        {"/Developer is not empty.", "Failed to verify the disk image mount path /Developer."}, {open, unlink}},
       {"attach fails", [](auto& t) { t.attachResult.reset(); },
@@ -117,14 +98,19 @@ TEST_F(VerifiedMountTest, EachStepEndsTheAttemptWithItsLineUndoesWhatItMadeAndCo
     attachResult = "/dev/loop7";
     capture.Clear();
     c.arrange(*this);
-    EXPECT_EQ(Mount("Developer", c.mountPath).deviceNode.has_value(), std::string(c.name) == "mounted");
+    EXPECT_EQ(Mount(c.type, c.mountPath, manifest).deviceNode.has_value(), std::string(c.name) == "mounted");
     EXPECT_EQ(capture.Texts(log::Level::Default), c.lines);
     EXPECT_EQ(os.calls, c.calls);
   }
 }
 
 TEST_F(VerifiedMountTest, DigestComesFromTheVerifiedDescriptorAndFindsAnIdenticalImage) {
-  MountImageAt("/private/var/factory_mount/abc", "loop4");
+  // A mounted image staged below directories spelling the SHA-1 of "image".
+  const std::string backing = "/stage/0E76292794/888D4F1FA75FB3AFF4CA27C58F56A6/x.img";
+  const auto drive = registry.Publish(nullptr, "KxNimbrelHDDriveInKernel",
+                                      {{"image-path", plist::Value(plist::Bytes(backing.begin(), backing.end()))}});
+  registry.Publish(drive, "KxMedia", Medium("loop4"));
+  os.mounts.push_back({os::kMountReadOnly, "ext4", "/private/var/factory_mount/abc", "/dev/loop4"});
   os.AddFile(kImage, kFile);
   const VerifiedMountResult result = Mount("Factory", "/private/var/factory_mount/new");
   EXPECT_FALSE(result.deviceNode);
@@ -135,31 +121,27 @@ TEST_F(VerifiedMountTest, DigestComesFromTheVerifiedDescriptorAndFindsAnIdentica
   // A digest length the manifest cannot ask for stops before anything is looked up.
   os.AddFile(kImage, kFile);
   capture.Clear();
-  EXPECT_FALSE(Mount("Personalized", "/private/var/personalized_debug", ManifestWithDigestLength(32)).imageDigest);
+  EXPECT_FALSE(Mount("Personalized", "/private/var/personalized_debug", testing::ManifestOf("DebugDiskImage", 32)).imageDigest);
   EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre("Unsupported digest size: 32", "Failed to digest data.",
                                           "Failed to digest /private/var/stage/image.img."));
 }
 
 // A controller that attaches whatever it is asked to and publishes its media at once.
-class FakeController : public registry::UserClient {
- public:
+struct FakeController : registry::UserClient {
   FakeController(registry::RegistryModel& registry, std::vector<plist::Dictionary>& requests)
-      : registry_(registry), requests_(requests) {}
+      : registry(registry), requests(requests) {}
   registry::Status CallMethod(uint32_t, registry::MethodArgs& args) override {
-    uint64_t address = 0, length = 0;
-    std::memcpy(&address, args.structIn.data() + 8, 8);
-    std::memcpy(&length, args.structIn.data() + 16, 8);
-    const auto request = plist::ReadXml({reinterpret_cast<const uint8_t*>(address), length});
-    requests_.push_back(*request->dictionary());
-    auto drive = registry_.Publish(nullptr, "KxNimbrelHDDriveInKernel",
-                                   {{"nimbrel-unique-identifier", *request->get("nimbrel-unique-identifier")}});
-    registry_.Publish(drive, "KxMedia", Medium("loop" + std::to_string(requests_.size())));
+    uint64_t location[2] = {};  // address, length
+    std::memcpy(location, args.structIn.data() + 8, sizeof location);
+    const auto request = plist::ReadXml({reinterpret_cast<const uint8_t*>(location[0]), location[1]});
+    requests.push_back(*request->dictionary());
+    auto drive = registry.Publish(nullptr, "KxNimbrelHDDriveInKernel",
+                                  {{"nimbrel-unique-identifier", *request->get("nimbrel-unique-identifier")}});
+    registry.Publish(drive, "KxMedia", Medium("loop" + std::to_string(requests.size())));
     return registry::kSuccess;
   }
-
- private:
-  registry::RegistryModel& registry_;
-  std::vector<plist::Dictionary>& requests_;
+  registry::RegistryModel& registry;
+  std::vector<plist::Dictionary>& requests;
 };
 
 TEST_F(VerifiedMountTest, AttachCarriesTheVerifiedIdentityAndStopsWhenTheLeaseWasBroken) {

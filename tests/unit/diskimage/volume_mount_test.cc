@@ -3,12 +3,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <map>
-
-#include "base/log.h"
 #include "diskimage/volume_mount.h"
-#include "fake_os.h"
-#include "platform/services.h"
+#include "disk_image_fixture.h"
 
 namespace brisvale {
 namespace {
@@ -58,50 +54,12 @@ TEST(TextEncodingTest, ChoiceFromTheBlockTheBiasAndTheUserFile) {
   }
 }
 
-class VolumeOs : public testing::FakeOs {
- public:
-  std::map<std::string, std::string, std::less<>> files;
-  int mountResult = 0;
-  std::vector<std::string> calls;
-  uint32_t mountFlags = 0;
-  os::VolumeMountArguments mountArguments;
-
-  int ReadFile(const char* path, size_t limit, std::vector<uint8_t>& contents) override {
-    const auto found = files.find(path);
-    if (found == files.end()) return -ENOENT;
-    contents.assign(found->second.begin(), found->second.begin() + std::min(limit, found->second.size()));
-    return 0;
-  }
-  int MountVolume(const char* type, const char* mountPoint, uint32_t flags,
-                  const os::VolumeMountArguments& arguments) override {
-    calls.push_back(std::string("mount ") + type + " " + arguments.devicePath + " " + mountPoint);
-    mountFlags = flags;
-    mountArguments = arguments;
-    return mountResult;
-  }
-  int Unmount(const char* path, bool force) override { return Call(force ? "force-unmount " : "unmount ", path, 0); }
-  int OpenDevice(const char* path) override { return Call("open ", path, ::dup(STDIN_FILENO)); }
-  int EjectDevice(int) override { return Call("eject", "", 0); }
-
- private:
-  int Call(const char* what, const char* path, int result) {
-    calls.push_back(what + std::string(path));
-    return result;
-  }
-};
-
-class VolumeMountTest : public ::testing::Test {
- protected:
-  VolumeMountTest() : services_(Services{nullptr, &os, nullptr, nullptr}) { SetVersion("", "21.4.5"); }
+struct VolumeMountTest : testing::DiskImageTest {
+  VolumeMountTest() { SetVersion("", "21.4.5"); }
   void SetVersion(const std::string& mountPath, const std::string& version) {
-    os.files[mountPath + std::string(kSystemVersionPath)] =
+    os.contents[mountPath + std::string(kSystemVersionPath)] =
         "<plist version=\"1.0\"><dict><key>ProductVersion</key><string>" + version + "</string></dict></plist>";
   }
-  VolumeOs os;
-  log::CaptureSink capture;
-
- private:
-  ScopedServices services_;
 };
 
 TEST_F(VolumeMountTest, VersionComparison) {
@@ -125,7 +83,7 @@ TEST_F(VolumeMountTest, VersionComparison) {
   };
   for (const Case& c : cases) {
     capture.Clear();
-    os.files.clear();
+    os.contents.clear();
     if (*c.image) SetVersion("/Developer", c.image);
     SetVersion("", c.system);
     EXPECT_EQ(VerifySystemVersion("/Developer"), c.matches) << c.image;

@@ -1,7 +1,9 @@
-// An operating system whose files are a table the test fills; every call that changes
-// something is recorded.
+// The fake system every disk-image unit test runs on: an operating system whose files
+// are a table the test fills, recording every call that changes something, installed
+// with a registry and a log capture as the current services.
 #pragma once
 
+#include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <cstdio>
@@ -9,7 +11,11 @@
 #include <string>
 #include <vector>
 
+#include "base/log.h"
 #include "fake_os.h"
+#include "platform/services.h"
+#include "qor4_test_support.h"
+#include "registry/registry_model.h"
 
 namespace brisvale::testing {
 
@@ -18,6 +24,7 @@ inline constexpr uint32_t kDirectory = 0040755, kFile = 0100644, kLink = 0120777
 class FileTreeOs : public FakeOs {
  public:
   std::map<std::string, os::FileStatus, std::less<>> files;
+  std::map<std::string, std::string, std::less<>> contents;   // what ReadFile finds
   std::map<std::string, int, std::less<>> mkdirErrors;        // -errno by path
   std::map<std::string, std::string, std::less<>> realPaths;  // when not the path itself
   std::vector<std::string> calls;
@@ -25,6 +32,9 @@ class FileTreeOs : public FakeOs {
   std::optional<os::FileStatus> openedStatus;  // what fstat says of the opened image
   int leaseResult = 0;
   bool leaseHeld = true;
+  int mountResult = 0;
+  uint32_t mountFlags = 0;
+  os::VolumeMountArguments mountArguments;
 
   void AddFile(const std::string& path, uint32_t mode) { files[path] = os::FileStatus{mode, 7, 1, 1}; }
 
@@ -67,6 +77,12 @@ class FileTreeOs : public FakeOs {
     visit({os::TreeNode::Kind::DirectoryPostorder, root, 0, false, {}, -1});
     return {};
   }
+  int ReadFile(const char* path, size_t limit, std::vector<uint8_t>& bytes) override {
+    const auto found = contents.find(path);
+    if (found == contents.end()) return -ENOENT;
+    bytes.assign(found->second.begin(), found->second.begin() + std::min(limit, found->second.size()));
+    return 0;
+  }
   // The image reads "image" through a real descriptor.
   int OpenImageFile(const char* path) override {
     calls.push_back("open-image " + std::string(path));
@@ -82,11 +98,18 @@ class FileTreeOs : public FakeOs {
   }
   int TakeReadLease(int) override { return leaseResult; }
   bool HoldsReadLease(int) override { return leaseHeld; }
+  int MountVolume(const char* type, const char* mountPoint, uint32_t flags,
+                  const os::VolumeMountArguments& arguments) override {
+    calls.push_back(std::string("mount ") + type + " " + arguments.devicePath + " " + mountPoint);
+    mountFlags = flags;
+    mountArguments = arguments;
+    return mountResult;
+  }
   int Unlink(const char* path) override {
     calls.push_back("unlink " + std::string(path));
     return files.erase(path) ? 0 : -ENOENT;
   }
-  int Unmount(const char* path, bool) override { return Record("force-unmount ", path); }
+  int Unmount(const char* path, bool force) override { return Record(force ? "force-unmount " : "unmount ", path); }
   int RemoveDirectory(const char* path) override { return Record("rmdir ", path); }
   int OpenDevice(const char* path) override { return Record("open ", path) + ::dup(STDIN_FILENO); }
   int EjectDevice(int) override { return Record("eject", ""); }
@@ -96,6 +119,23 @@ class FileTreeOs : public FakeOs {
     calls.push_back(call + std::string(path));
     return 0;
   }
+};
+
+// A manifest for this device whose image names `subType` and has a digest of
+// `digestLength` bytes.
+inline derwriter::Bytes ManifestOf(std::string_view subType, size_t digestLength = 48) {
+  using namespace derwriter;
+  const Bytes name(subType.begin(), subType.end());
+  return testing_support::DefaultManifest(ManifestBody(
+      testing_support::DefaultManifestProperties(),
+      {{"pdmg", {DataProperty("DGST", Bytes(digestLength, 1)), DataProperty("pdnm", name)}}}));
+}
+
+struct DiskImageTest : ::testing::Test {
+  FileTreeOs os;
+  registry::RegistryModel registry;
+  log::CaptureSink capture;
+  ScopedServices services{Services{&registry, &os, nullptr, nullptr}};
 };
 
 }  // namespace brisvale::testing
