@@ -9,6 +9,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <thread>
 
 #include "base/unique_fd.h"
 #include "loop_mount.h"
@@ -47,7 +48,9 @@ bool Imgtool(std::vector<std::string> args) {
 }
 
 // Mounts below `root` other than the sandbox's own, and loop devices backed by its files.
-std::vector<std::string> LeftBehind(const std::string& root) {
+// A device detached while the kernel still holds it open goes a moment after the reply,
+// so what is found is looked at again for up to five seconds.
+std::vector<std::string> LeftBehind(const std::string& root, int retries = 250) {
   std::vector<std::string> found;
   std::vector<os::MountRecord> mounts;
   os::CopyMountTable(os::SystemOs(), mounts);
@@ -61,7 +64,9 @@ std::vector<std::string> LeftBehind(const std::string& root) {
     std::string file;
     if (std::getline(backing, file) && file.starts_with(root)) found.push_back(file);
   }
-  return found;
+  if (found.empty() || retries == 0) return found;
+  std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  return LeftBehind(root, retries - 1);
 }
 
 struct DiskImageTest : ::testing::Test {
