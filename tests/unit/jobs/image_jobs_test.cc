@@ -1,3 +1,4 @@
+// Loading the jobs of a mounted image (jobs/image_jobs): which are rewritten, submitted or refused.
 #include "jobs/image_jobs.h"
 
 #include <gtest/gtest.h>
@@ -38,12 +39,12 @@ struct RecordingLauncher : jobs::JobLauncher {
 };
 
 struct ImageJobs : ::testing::Test {
-  testing::TempTree tree;
+  testing::JobTree tree;
   RootedOs os;
   RecordingLauncher launcher;
   ScopedServices services{Services{.os = &os, .jobLauncher = &launcher}};
   log::CaptureSink capture;
-  ImageJobs() { os.root = tree.root.string(); }
+  ImageJobs() { os.root = tree.path().string(); }
 };
 
 TEST_F(ImageJobs, FactoryJobsAreRewrittenAndRefusalsOnlyLogged) {
