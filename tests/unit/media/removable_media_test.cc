@@ -232,83 +232,64 @@ TEST_F(MediaTest, AttachFiltersRunInOrderAndEachFailureFlagShowsItsAlert) {
   EXPECT_EQ(ipc.count, 0) << "the handler's own transaction ends with it";
 }
 
-TEST_F(MediaTest, OutcomeFlagsAndMountPointByVolumeToolsAndPresentPaths) {
+// A "Mount" / "MassStorage" request through check, repair and mount: the failure flags show
+// as the request's lines, the mount point as its reply.
+TEST_F(MediaTest, MountRequestByNodeVolumeToolsPresentPathsAndReadOnlyValue) {
+  model.Publish(usbDisk, "KxMedia", With(Medium("sdb1", true), "Content", plist::Value("")));
   const std::set<std::string> four{"/var/mnt/mount1", "/var/mnt/mount2", "/var/mnt/mount3", "/var/mnt/mount4"};
+  const plist::Dictionary sdb1{{"DeviceNode", plist::Value("/dev/sdb1")}};
+  const std::string verification = "Failed to mount /dev/sdb1: verification issues", mount = "Failed to mount /dev/sdb1.";
   struct Case {
     std::string volume;
     std::map<std::string, int> answers;
     std::set<std::string> present;
-    std::optional<std::string> result;
-    bool verificationFailed, mountFailed;
-    std::string line;
-  };
-  const Case cases[] = {
-      {"HFS+", {}, {}, "/private/var/mnt/mount1", false, false, "Successfully mounted /var/mnt/mount1."},
-      {"HFSX", {{"fsck_hfs -q", 3}}, {"/var/mnt/mount1"}, "/private/var/mnt/mount2", false, false,
-       "The filesystem at /dev/sdb1 appears to be dirty."},
-      {"HFS+", {}, {"/var/mnt/mount2"}, "/private/var/mnt/mount1", false, false, "Posting notification: com.vantrel.brisvale_mounted"},
-      {"HFS+", {}, four, std::nullopt, false, true, "Failed to determine mount path."},
-      {"HFS+", {{"fsck_hfs -fy", 8}}, {}, std::nullopt, true, false, "Repairing the HFS+ filesystem at /dev/sdb1."},
-      {"HFS+", {{"fsck_hfs -fy", kSpawnMissing}}, {}, std::nullopt, true, false, "Failed to spawn /sbin/fsck_hfs : 2"},
-      {"HFS+", {{"mount_hfs -o", 1}}, {}, std::nullopt, false, true, "Failed to mount /dev/sdb1 on /var/mnt/mount1."},
-      {"NTFS", {}, {}, std::nullopt, false, true, "Unknown or unsupported filesystem at /dev/sdb1: [MSDOS_NTFS]."},
-      {"none", {}, {}, std::nullopt, false, true, "Unknown or unsupported filesystem at /dev/sdb1: [Unknown]."},
-      {"FAT", {}, {}, "/dev/sdb1", false, false, "MSDOS FAT filesystem at /dev/sdb1. Skipping mount."},
-      {"EXFAT", {}, {}, "/dev/sdb1", false, false, "MSDOS EXFAT filesystem at /dev/sdb1. Skipping mount."},
+    std::string mountPath;  // empty: the request fails
+    Lines lines;            // among those logged
+    plist::Dictionary request = {{"DeviceNode", plist::Value("/dev/sdb1")}};
+    std::string option = "noowners";
+  } cases[] = {
+      {"HFS+", {}, {}, "/private/var/mnt/mount1", {"Successfully mounted /var/mnt/mount1."}},
+      {"HFSX", {{"fsck_hfs -q", 3}}, {"/var/mnt/mount1"}, "/private/var/mnt/mount2",
+       {"The filesystem at /dev/sdb1 appears to be dirty.", "Posting notification: com.vantrel.brisvale_mounted"}},
+      {"HFS+", {}, {"/var/mnt/mount2"}, "/private/var/mnt/mount1", {}},
+      {"HFS+", {}, four, "", {"Failed to determine mount path.", mount}},
+      {"HFS+", {{"fsck_hfs -fy", 8}}, {}, "", {"Repairing the HFS+ filesystem at /dev/sdb1.", verification}},
+      {"HFS+", {{"fsck_hfs -fy", kSpawnMissing}}, {}, "", {"Failed to spawn /sbin/fsck_hfs : 2", verification}},
+      {"HFS+", {{"mount_hfs -o", 1}}, {}, "", {"Failed to mount /dev/sdb1 on /var/mnt/mount1.", mount}},
+      {"NTFS", {}, {}, "", {"Unknown or unsupported filesystem at /dev/sdb1: [MSDOS_NTFS].", mount}},
+      {"none", {}, {}, "", {"Unknown or unsupported filesystem at /dev/sdb1: [Unknown].", mount}},
+      {"FAT", {}, {}, "/dev/sdb1", {"MSDOS FAT filesystem at /dev/sdb1. Skipping mount."}},
+      {"EXFAT", {}, {}, "/dev/sdb1", {"MSDOS EXFAT filesystem at /dev/sdb1. Skipping mount."}},
+      {"", {}, {}, "", {"Invalid value for DeviceNode: (null)"}, {}},
+      {"", {}, {}, "", {"Invalid value for DeviceNode: 3"}, {{"DeviceNode", plist::Value::Int(3)}}},
+      {"", {}, {}, "", {"There is no matching mass storage entry for /dev/sdz9."}, {{"DeviceNode", plist::Value("/dev/sdz9")}}},
+      {"HFS+", {}, {}, "/private/var/mnt/mount1", {}, With(sdb1, "MountReadOnly", plist::Value::Bool(true)), "rdonly"},
+      {"HFS+", {}, {}, "/private/var/mnt/mount1", {}, With(sdb1, "MountReadOnly", plist::Value("true"))},
+      {"HFS+", {}, {}, "/private/var/mnt/mount1", {}, With(sdb1, "MountReadOnly", plist::Value::Int(1))},
   };
   for (const Case& c : cases) {
-    SCOPED_TRACE(c.line);
+    SCOPED_TRACE(c.volume + " " + plist::Value(c.request).description() + (c.lines.empty() ? "" : " " + c.lines[0]));
     os.existing = c.present, os.existing.insert("/var/mnt"), os.mounts.clear(), os.answers = c.answers;
     notifier.posted.clear(), capture.Clear(), os.volumeHeaders.clear(), os.spawned.clear();
     if (c.volume != "none") os.volumeHeaders["/dev/sdb1"] = Header(c.volume);
-    bool verificationFailed = false, mountFailed = false;
-    EXPECT_EQ(MountMassStorageDevice("/dev/sdb1", false, verificationFailed, mountFailed), c.result);
-    EXPECT_EQ(verificationFailed, c.verificationFailed);
-    EXPECT_EQ(mountFailed, c.mountFailed);
-    EXPECT_THAT(capture.Texts(), ::testing::Contains(c.line));
-    EXPECT_EQ(notifier.Names(), c.result ? Lines{"com.vantrel.brisvale_mounted"} : Lines{});
-    // FAT and exFAT never reach a tool; a mount point is made only after a passed repair.
-    EXPECT_EQ(os.spawned.empty(), !c.volume.starts_with("HFS"));
-    EXPECT_EQ(os.existing.size() - c.present.size() - 1, c.volume.starts_with("HFS") && !c.verificationFailed && c.present != four);
-  }
-}
-
-TEST_F(MediaTest, RequestValidatesNodeAndReadsReadOnlyAsBooleanOnly) {
-  model.Publish(usbDisk, "KxMedia", With(Medium("sdb1", true), "Content", plist::Value("")));
-  const plist::Value node("/dev/sdb1");
-  struct Case {
-    plist::Dictionary request;
-    std::string optionOrLine;
-    std::map<std::string, int> answers = {};
-  } cases[] = {
-      {{}, "Invalid value for DeviceNode: (null)"},
-      {{{"DeviceNode", plist::Value::Int(3)}}, "Invalid value for DeviceNode: 3"},
-      {{{"DeviceNode", plist::Value("/dev/sdz9")}}, "There is no matching mass storage entry for /dev/sdz9."},
-      {{{"DeviceNode", node}}, "Failed to mount /dev/sdb1: verification issues", {{"fsck_hfs -fy", 8}}},
-      {{{"DeviceNode", node}}, "Failed to mount /dev/sdb1.", {{"mount_hfs -o", 1}}},
-      {{{"DeviceNode", node}, {"MountReadOnly", plist::Value::Bool(true)}}, "rdonly"},
-      {{{"DeviceNode", node}, {"MountReadOnly", plist::Value("true")}}, "noowners"},
-      {{{"DeviceNode", node}, {"MountReadOnly", plist::Value::Int(1)}}, "noowners"},
-  };
-  os.volumeHeaders["/dev/sdb1"] = Header("HFS+");
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.optionOrLine);
-    os.existing = {"/var/mnt"}, os.mounts.clear(), os.spawned.clear(), os.answers = c.answers, capture.Clear();
     plist::Dictionary reply{{"Status", plist::Value("Failure")}};
     HandleMassStorageMount(plist::Value(c.request), reply);
-    const bool mounted = c.optionOrLine == "rdonly" || c.optionOrLine == "noowners";
-    EXPECT_EQ(*reply.find("Status"), plist::Value(mounted ? "Success" : "Failure"));
-    if (!mounted) {
-      EXPECT_TRUE(capture.Contains(log::Level::Default, c.optionOrLine));
-      continue;
+    EXPECT_EQ(*reply.find("Status"), plist::Value(c.mountPath.empty() ? "Failure" : "Success"));
+    EXPECT_EQ(reply.find("MountPath") ? *reply.find("MountPath") : plist::Value(""), plist::Value(c.mountPath));
+    for (const std::string& line : c.lines) EXPECT_THAT(capture.Texts(), ::testing::Contains(line));
+    EXPECT_EQ(notifier.Names(), c.mountPath.empty() ? Lines{} : Lines{"com.vantrel.brisvale_mounted"});
+    // FAT and exFAT never reach a tool; a mount point is made only after a passed repair.
+    const bool hfs = c.volume.starts_with("HFS");
+    EXPECT_EQ(os.spawned.empty(), !hfs);
+    EXPECT_EQ(os.existing.size() - c.present.size() - 1, hfs && c.answers.count("fsck_hfs -fy") == 0 && c.present != four);
+    if (hfs && !c.mountPath.empty()) {
+      EXPECT_EQ(os.spawned.back(), (Argv{"/sbin/mount_hfs", "-o", c.option, "/dev/sdb1", c.mountPath.substr(8)}));
     }
-    EXPECT_EQ(*reply.find("MountPath"), plist::Value("/private/var/mnt/mount1"));
-    EXPECT_EQ(os.spawned.back(), (Argv{"/sbin/mount_hfs", "-o", c.optionOrLine, "/dev/sdb1", "/var/mnt/mount1"}));
   }
   // Asked again while mounted: refused before any tool runs.
   os.spawned.clear();
   plist::Dictionary reply;
-  HandleMassStorageMount(plist::Value(plist::Dictionary{{"DeviceNode", node}}), reply);
+  HandleMassStorageMount(plist::Value(sdb1), reply);
   EXPECT_TRUE(capture.Contains(log::Level::Default, "/dev/sdb1 is already mounted."));
   EXPECT_TRUE(os.spawned.empty());
   EXPECT_EQ(reply.find("MountPath"), nullptr);
