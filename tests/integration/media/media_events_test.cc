@@ -12,6 +12,7 @@
 #include <thread>
 
 #include "media_doubles.h"
+#include "platform/linux/notify_center.h"
 #include "plist_printers.h"
 #include "sandbox_daemon.h"
 
@@ -44,11 +45,13 @@ plist::Value PartitionedStick(const std::string& disk) {
                       {plist::Value(std::move(wholeDisk))});
 }
 
-plist::Value Camera(const std::string& name, int64_t location) {
+// A USB device with one still-image interface (protocol 1) or another one.
+plist::Value Camera(const std::string& name, std::optional<int64_t> location, int64_t protocol = 1) {
+  plist::Dictionary interface{{"bInterfaceClass", plist::Value::Int(6)}, {"bInterfaceSubClass", plist::Value::Int(1)},
+                              {"bInterfaceProtocol", plist::Value::Int(protocol)}};
+  if (location) interface.set("locationID", plist::Value::Int(*location));
   return DeviceObject(name, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}},
-                      {DeviceObject("ptp", "KxUSBHostInterface",
-                                    {{"bInterfaceClass", plist::Value::Int(6)}, {"bInterfaceSubClass", plist::Value::Int(1)},
-                                     {"bInterfaceProtocol", plist::Value::Int(1)}, {"locationID", plist::Value::Int(location)}})});
+                      {DeviceObject("ptp", "KxUSBHostInterface", std::move(interface))});
 }
 
 // The type and options of what is mounted at `path` (as seen from outside), or "".
@@ -126,24 +129,38 @@ TEST_F(MediaTest, MountsByRequestWithTheToolDoubles) {
 TEST_F(MediaTest, SticksAndCamerasArePluggedAnnouncedListedAndSticksTakenAwayWhenPulled) {
   ASSERT_NO_FATAL_FAILURE(Start({{"sdb2", "hfs+", "dirty"}, {"sdc1", "hfsx", ""}, {"sdd1", "fat", ""}},
                                 {PartitionedStick("sdb"), Stick("sdc1"), Stick("sdd1"), Camera("camera-a", 0x14100000),
-                                 Camera("camera-b", 0x14200000)}));
+                                 Camera("other", 0x14400000, 2), Camera("camera-b", 0x14200000),
+                                 Camera("camera-c", std::nullopt)}));
+  std::string error;
+  const auto subscriber = notify::Subscriber::Create(daemon.Path("/private/var/run/vexa/notify"), &error);
+  ASSERT_TRUE(subscriber) << error;
+  // The notifications that arrived within a short while, with their payloads.
+  const auto received = [&] {
+    std::vector<std::pair<std::string, plist::Value>> all;
+    while (auto n = subscriber->Receive(300ms)) all.emplace_back(n->name, n->userInfo ? plist::Value(*n->userInfo) : plist::Value());
+    return all;
+  };
+  const auto camera = [](int64_t location) {
+    return std::pair{std::string("com.vantrel.mobile.camera_attached"),
+                     plist::Value(plist::Dictionary{{"LocationID", plist::Value::Int(location)},
+                                                    {"DeviceType", plist::Value("PTPCamera")}})};
+  };
+  const std::pair<std::string, plist::Value> mounted{"com.vantrel.brisvale_mounted", plist::Value()};
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.mobile.ptp_camera").ok());
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
   ASSERT_TRUE(daemon.WaitForLogLine("default: Successfully mounted /var/mnt/mount2."));
 
+  // Each camera is announced (two mounts and the FAT stick's record follow); the list
+  // holds the last one found.
+  EXPECT_EQ(received(), (std::vector{camera(0x14100000), camera(0x14200000), mounted, mounted, mounted}));
+  EXPECT_TRUE(daemon.LogContains("default: Failed to retrieve locationID."));
+  EXPECT_EQ(ListedDevice(daemon, "PTPNode"), *camera(0x14200000).second.dictionary());
   EXPECT_TRUE(daemon.LogContains("debug: The attached media sdb is not a leaf, ignoring."));
   EXPECT_TRUE(daemon.LogContains("debug: Successfully repaired /dev/sdb2."));
-  EXPECT_EQ(CountLines("default: Posting notification: com.vantrel.brisvale_mounted"), 3u)
-      << "two mounts and the FAT stick's record";
   EXPECT_THAT(MountOptions(daemon.Path("/private/var/mnt/mount1")), StartsWith("/dev/sdb2 "));
   EXPECT_EQ(*ListedDevice(daemon, "/dev/sdc1").value_or(plist::Dictionary{}).find("MountPath"),
             plist::Value("/private/var/mnt/mount2"));
   EXPECT_TRUE(ListedDevice(daemon, "/dev/sdd1")) << "a FAT stick is listed though not mounted";
-  // Each camera is announced; the list holds the last one found.
-  EXPECT_EQ(CountLines("default: Posting notification: com.vantrel.mobile.camera_attached"), 2u);
-  const auto camera = ListedDevice(daemon, "PTPNode");
-  ASSERT_TRUE(camera);
-  EXPECT_EQ(*camera->find("LocationID"), plist::Value::Int(0x14200000));
 
   // A second event finds them mounted and runs no tool.
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
@@ -154,6 +171,8 @@ TEST_F(MediaTest, SticksAndCamerasArePluggedAnnouncedListedAndSticksTakenAwayWhe
   WriteDevices({Stick("sdc1"), Stick("sdd1")});
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.detached").ok());
   ASSERT_TRUE(daemon.WaitForLogLine("default: Posting notification: com.vantrel.brisvale_unmounted"));
+  // The FAT stick is not in the mount table, so the second event recorded it again.
+  EXPECT_EQ(received(), (std::vector<std::pair<std::string, plist::Value>>{mounted, {"com.vantrel.brisvale_unmounted", {}}}));
   EXPECT_FALSE(std::filesystem::exists(daemon.Path("/private/var/mnt/mount1")));
   EXPECT_EQ(MountOptions(daemon.Path("/private/var/mnt/mount1")), "");
   EXPECT_NE(MountOptions(daemon.Path("/private/var/mnt/mount2")), "");

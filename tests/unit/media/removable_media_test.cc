@@ -1,7 +1,7 @@
 // Removable media over the in-process registry and a fake operating system whose tools
 // answer from the test: which media the attach filters let through and which alert each
-// mount failure shows, check, repair and mount, how subscriptions replace each other,
-// what a detach unmounts, how cameras are announced, and the real spawn-and-wait.
+// mount failure shows, check, repair and mount, how subscriptions replace each other and
+// keep the process alive, what a detach unmounts, and the real spawn-and-wait.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
@@ -13,7 +13,6 @@
 #include "base/log.h"
 #include "base/runloop.h"
 #include "fake_os.h"
-#include "media/cameras.h"
 #include "media/fs_check.h"
 #include "media/mass_storage_mount.h"
 #include "media/media_attach.h"
@@ -154,13 +153,6 @@ struct MediaTest : ::testing::Test {
       alerts.push_back(std::string(title) + "/" + button + "/" + *media->Property("BSD Name")->string());
     });
     return capture.Texts();
-  }
-  registry::ObjectRef Camera(int64_t protocol, std::optional<int64_t> location) {
-    plist::Dictionary properties{{"bInterfaceClass", plist::Value::Int(6)},
-                                 {"bInterfaceSubClass", plist::Value::Int(1)},
-                                 {"bInterfaceProtocol", plist::Value::Int(protocol)}};
-    if (location) properties.set("locationID", plist::Value::Int(*location));
-    return model.Publish(usbDisk, "KxUSBHostInterface", std::move(properties));
   }
 
   RunLoop loop;
@@ -333,26 +325,6 @@ TEST_F(MediaTest, EverySubscriptionKeepsTheProcessAliveForItsInterval) {
   EXPECT_EQ(ipc.count, 2);
   for (int i = 0; i < 400 && ipc.count != 0; ++i) std::this_thread::sleep_for(5ms);
   EXPECT_EQ(ipc.count, 0);
-}
-
-TEST_F(MediaTest, CamerasAreAnnouncedEachAndListedOnce) {
-  EXPECT_THAT(*CopyCameraEntries(), IsEmpty());
-  Camera(1, 0x14100000);
-  Camera(2, 0x14200000);  // not a still-image interface
-  Camera(1, std::nullopt);
-  Camera(1, 0x14300000);
-  SubscribeCameraAttach(context);
-  std::vector<plist::Value> payloads;
-  for (const notify::Notification& posted : notifier.posted) {
-    EXPECT_EQ(posted.name, "com.vantrel.mobile.camera_attached");
-    payloads.push_back(posted.userInfo ? plist::Value(*posted.userInfo) : plist::Value());
-  }
-  const auto record = [](int64_t location) {
-    return plist::Value(plist::Dictionary{{"LocationID", plist::Value::Int(location)}, {"DeviceType", plist::Value("PTPCamera")}});
-  };
-  EXPECT_THAT(payloads, ElementsAre(record(0x14100000), record(0x14300000)));
-  EXPECT_TRUE(capture.Contains(Level::Default, "Failed to retrieve locationID."));
-  EXPECT_EQ(*CopyCameraEntries(), (plist::Dictionary{{"PTPNode", record(0x14300000)}}));
 }
 
 TEST_F(MediaTest, DetachUnmountsOnlyPulledMassStorage) {
