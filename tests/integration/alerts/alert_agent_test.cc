@@ -1,16 +1,13 @@
 // User alerts (media/user_alerts) over the real alert service of a scratch root: what is
 // shown, read off the agent socket; what is dropped; what takes an alert down; agents
-// that misbehave or are missing; the preference file; and `brisvalectl alert-agent`.
-#include <fcntl.h>
-#include <signal.h>
+// that misbehave or are missing; the preference file. (The console agent is exercised
+// with the daemon, in tests/integration/media.)
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <filesystem>
 #include <fstream>
 
@@ -255,50 +252,6 @@ TEST_F(AlertsTest, FailedRemovalWatchLeavesTheAlertUpUntilAnswered) {
   const plist::Bytes answer = alert::EncodeResponseFrame(0);
   EXPECT_EQ(send(Accept(listener).get(), answer.data(), answer.size(), MSG_NOSIGNAL), static_cast<ssize_t>(answer.size()));
   EXPECT_TRUE(RunUntilAlertDown());
-}
-
-// `brisvalectl alert-agent --json` on a console: shows, answers on Enter, reports a cancel.
-TEST_F(AlertsTest, ConsoleAgentShowsAnswersOnEnterAndReportsCancels) {
-  const std::string output = root.str() + "/agent.out";
-  int keyboard[2];
-  ASSERT_EQ(pipe2(keyboard, O_CLOEXEC), 0);
-  const pid_t agent = fork();
-  ASSERT_GE(agent, 0);
-  if (agent == 0) {
-    dup2(keyboard[0], STDIN_FILENO);
-    if (freopen(output.c_str(), "w", stdout)) execl(BRISVALECTL, BRISVALECTL, "--root", root.str().c_str(), "--json", "alert-agent", nullptr);
-    _exit(127);
-  }
-  close(keyboard[0]);
-  UniqueFd enter(keyboard[1]);
-  // Runs the loop until the agent has printed `text` `times` times.
-  const auto printed = [&](const std::string& text, long times = 1) {
-    for (int tries = 0; tries < 250; loop.RunFor(20ms), ++tries) {
-      std::ifstream in(output);
-      const std::string all{std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
-      long found = 0;
-      for (size_t at = all.find(text); at != std::string::npos; at = all.find(text, at + 1)) ++found;
-      if (found >= times) return true;
-    }
-    return false;
-  };
-  ASSERT_TRUE(printed("\"event\": \"listening\""));
-  ShowMountFailure(Medium());
-  EXPECT_TRUE(printed("\"title\": \"Cannot Use Storage Device\""));
-  EXPECT_TRUE(printed("\"button\": \"OK\""));
-  ASSERT_EQ(write(enter.get(), "\n", 1), 1);
-  EXPECT_TRUE(RunUntilAlertDown());
-  EXPECT_TRUE(printed("\"event\": \"answered\""));
-
-  const registry::ObjectRef medium = Medium();
-  ShowMountFailure(medium);
-  EXPECT_TRUE(printed("\"event\": \"shown\"", 2));
-  registry.Terminate(medium);
-  EXPECT_TRUE(RunUntilAlertDown());
-  EXPECT_TRUE(printed("\"event\": \"cancelled\""));
-  EXPECT_TRUE(log.Lines().empty()) << log.Texts()[0];
-  kill(agent, SIGTERM);
-  waitpid(agent, nullptr, 0);
 }
 
 }  // namespace

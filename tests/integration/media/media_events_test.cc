@@ -1,8 +1,10 @@
 // Removable media against the real daemon in a sandbox root: simulated sticks mounted by
 // request, and plugged and pulled by editing the devices file, checked and mounted by
-// the tool doubles; failures shown by the console alert agent; simulated cameras announced.
+// the tool doubles; failures shown, answered and cancelled through the console alert
+// agent; simulated cameras announced.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <fcntl.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -11,6 +13,7 @@
 #include <fstream>
 #include <thread>
 
+#include "base/unique_fd.h"
 #include "media_doubles.h"
 #include "platform/linux/notify_center.h"
 #include "plist_printers.h"
@@ -179,30 +182,40 @@ TEST_F(MediaTest, SticksAndCamerasArePluggedAnnouncedListedAndSticksTakenAwayWhe
   EXPECT_FALSE(ListedDevice(daemon, "/dev/sdb2"));
 }
 
+// The console agent, `brisvalectl alert-agent`, shows each alert, answers on Enter, and
+// reports the alert of a stick pulled out while it is up as cancelled.
 TEST_F(MediaTest, UnusableSticksRaiseTheirAlertsThroughTheAgent) {
   ASSERT_NO_FATAL_FAILURE(Start({{"sde1", "ntfs", ""}, {"sdf1", "hfs+", "broken"}}, {}));
-  // One alert shows at a time, and this agent answers each at once.
   const std::string agentOutput = daemon.Path("/agent.out");
+  int keyboard[2];
+  ASSERT_EQ(pipe2(keyboard, O_CLOEXEC), 0);
   const pid_t agent = fork();
   ASSERT_GE(agent, 0);
   if (agent == 0) {
+    dup2(keyboard[0], STDIN_FILENO);
     if (freopen(agentOutput.c_str(), "w", stdout)) {
-      execl(BRISVALE_CTL_PATH, BRISVALE_CTL_PATH, "--root", daemon.root().c_str(), "--json", "--auto-dismiss", "0",
-            "alert-agent", nullptr);
+      execl(BRISVALE_CTL_PATH, BRISVALE_CTL_PATH, "--root", daemon.root().c_str(), "--json", "alert-agent", nullptr);
     }
     _exit(127);
   }
-  EXPECT_TRUE(WaitForText(agentOutput, "listening"));
+  close(keyboard[0]);
+  const UniqueFd enter(keyboard[1]);
+  EXPECT_TRUE(WaitForText(agentOutput, "\"event\": \"listening\""));
   WriteDevices({Stick("sde1")});
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
   EXPECT_TRUE(daemon.WaitForLogLine("default: Failed to mount /dev/sde1."));
-  EXPECT_TRUE(WaitForText(agentOutput, "Cannot Use Storage Device"));
-  EXPECT_TRUE(WaitForText(agentOutput, "\"answered\""));
+  EXPECT_TRUE(WaitForText(agentOutput, "\"title\": \"Cannot Use Storage Device\""));
+  EXPECT_TRUE(WaitForText(agentOutput, "\"button\": \"OK\""));
+  ASSERT_EQ(write(enter.get(), "\n", 1), 1);
+  EXPECT_TRUE(WaitForText(agentOutput, "\"event\": \"answered\""));
 
   WriteDevices({Stick("sdf1")});
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
   EXPECT_TRUE(daemon.WaitForLogLine("default: Failed to mount /dev/sdf1: verification failed"));
-  EXPECT_TRUE(WaitForText(agentOutput, "Storage Device Needs Repair"));
+  EXPECT_TRUE(WaitForText(agentOutput, "\"title\": \"Storage Device Needs Repair\""));
+  WriteDevices({});
+  ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.detached").ok());
+  EXPECT_TRUE(WaitForText(agentOutput, "\"event\": \"cancelled\""));
   kill(agent, SIGTERM);
   waitpid(agent, nullptr, 0);
 }
