@@ -103,10 +103,6 @@ struct MediaTest : ::testing::Test {
     std::ofstream(daemon.Path("/devices.plist"))
         << plist::WriteXml(plist::Dictionary{{"Objects", plist::Value(std::move(objects))}});
   }
-  size_t CountLines(const std::string& line) {
-    const auto lines = daemon.LogLines();
-    return static_cast<size_t>(std::count(lines.begin(), lines.end(), line));
-  }
   SandboxDaemon daemon;
 };
 
@@ -165,17 +161,17 @@ TEST_F(MediaTest, SticksAndCamerasArePluggedAnnouncedListedAndSticksTakenAwayWhe
             plist::Value("/private/var/mnt/mount2"));
   EXPECT_TRUE(ListedDevice(daemon, "/dev/sdd1")) << "a FAT stick is listed though not mounted";
 
-  // A second event finds them mounted and runs no tool.
+  // A second event finds the sticks mounted and mounts nothing; the FAT stick, which is
+  // not in the mount table, is recorded again.
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
   ASSERT_TRUE(daemon.WaitForLogLine("default: /dev/sdc1 is already mounted."));
-  EXPECT_EQ(CountLines("default: Successfully mounted /var/mnt/mount1."), 1u);
+  EXPECT_EQ(received(), std::vector{mounted});
 
   // Pulled without an eject: only that stick's mount and mount point go.
   WriteDevices({Stick("sdc1"), Stick("sdd1")});
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.detached").ok());
   ASSERT_TRUE(daemon.WaitForLogLine("default: Posting notification: com.vantrel.brisvale_unmounted"));
-  // The FAT stick is not in the mount table, so the second event recorded it again.
-  EXPECT_EQ(received(), (std::vector<std::pair<std::string, plist::Value>>{mounted, {"com.vantrel.brisvale_unmounted", {}}}));
+  EXPECT_EQ(received(), (std::vector{std::pair{std::string("com.vantrel.brisvale_unmounted"), plist::Value()}}));
   EXPECT_FALSE(std::filesystem::exists(daemon.Path("/private/var/mnt/mount1")));
   EXPECT_EQ(MountOptions(daemon.Path("/private/var/mnt/mount1")), "");
   EXPECT_NE(MountOptions(daemon.Path("/private/var/mnt/mount2")), "");
