@@ -185,6 +185,9 @@ TEST_F(MediaTest, AttachFiltersRunInOrderAndEachFailureFlagShowsItsAlert) {
     int fails = 0;
     Lines alerts = {};
   } cases[] = {
+      // A GUID-partitioned stick delivers the whole disk, its EFI partition and its data partition.
+      {usbDisk, With(Medium("sdb", true, false), "Content", plist::Value("GUID_partition_scheme")),
+       {"Attached media content type: GUID_partition_scheme", "The attached media sdb is not a leaf, ignoring."}},
       {gptDisk, With(Medium("sdb1", false), "Content", plist::Value("C12A7328-F81F-11D2-BA4B-00A0C93EC93B")),
        {"Ignoring EFI partition."}},
       {gptDisk, With(Medium("sdb2", false), "Content", plist::Value("Vantrel_partition_map")),
