@@ -1,7 +1,8 @@
 // Removable media over the in-process registry and a fake operating system whose tools
 // answer from the test: which media the attach filters let through and which alert each
 // mount failure shows, check, repair and mount, how subscriptions replace each other and
-// keep the process alive, what a detach unmounts, and the real spawn-and-wait.
+// keep the process alive, how cameras are announced, what a detach unmounts, and the real
+// spawn-and-wait.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
@@ -13,6 +14,7 @@
 #include "base/log.h"
 #include "base/runloop.h"
 #include "fake_os.h"
+#include "media/cameras.h"
 #include "media/fs_check.h"
 #include "media/mass_storage_mount.h"
 #include "media/media_attach.h"
@@ -328,6 +330,27 @@ TEST_F(MediaTest, EverySubscriptionKeepsTheProcessAliveForItsInterval) {
   EXPECT_EQ(ipc.count, 2);
   for (int i = 0; i < 400 && ipc.count != 0; ++i) std::this_thread::sleep_for(5ms);
   EXPECT_EQ(ipc.count, 0);
+}
+
+// Also asserted against the daemon (tests/integration/media); here the handler runs
+// in-process, where coverage tools can see it.
+TEST_F(MediaTest, CamerasAreAnnouncedEachAndListedOnce) {
+  const auto record = [](int64_t location) {
+    return plist::Dictionary{{"LocationID", plist::Value::Int(location)}, {"DeviceType", plist::Value("PTPCamera")}};
+  };
+  for (const auto& [protocol, location] : {std::pair{1, 0x14100000}, {2, 0x14200000}, {1, -1}, {1, 0x14300000}}) {
+    plist::Dictionary interface{{"bInterfaceClass", plist::Value::Int(6)}, {"bInterfaceSubClass", plist::Value::Int(1)},
+                                {"bInterfaceProtocol", plist::Value::Int(protocol)}};
+    if (location >= 0) interface.set("locationID", plist::Value::Int(location));  // -1: none
+    model.Publish(usbDisk, "KxUSBHostInterface", std::move(interface));
+  }
+  SubscribeCameraAttach(context);
+  std::vector<std::optional<plist::Dictionary>> payloads;
+  for (const notify::Notification& posted : notifier.posted) payloads.push_back(posted.userInfo);
+  EXPECT_THAT(payloads, ElementsAre(record(0x14100000), record(0x14300000)));
+  EXPECT_EQ(notifier.Names(), Lines(2, "com.vantrel.mobile.camera_attached"));
+  EXPECT_TRUE(capture.Contains(Level::Default, "Failed to retrieve locationID."));
+  EXPECT_EQ(*CopyCameraEntries(), (plist::Dictionary{{"PTPNode", plist::Value(record(0x14300000))}}));
 }
 
 TEST_F(MediaTest, DetachUnmountsOnlyPulledMassStorage) {
