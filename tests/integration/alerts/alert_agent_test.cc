@@ -1,10 +1,9 @@
-// Alerts through the real agent socket of a scratch root: shown, answered and cancelled
-// with `brisvalectl alert-agent`; agents that misbehave; no agent at all.
-#include <fcntl.h>
-#include <signal.h>
+// User alerts (media/user_alerts) over the real alert service of a scratch root: what is
+// shown, read off the agent socket; what is dropped; what takes an alert down; agents
+// that misbehave or are missing; the preference file. (The console agent is exercised
+// with the daemon, in tests/integration/media.)
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -19,190 +18,240 @@
 #include "platform/linux/ipc_socket.h"
 #include "platform/services.h"
 #include "registry/registry_model.h"
+#include "test_files.h"
 
 namespace brisvale {
 namespace {
 
 using namespace std::chrono_literals;
+using Lines = std::vector<std::string>;
 
-// `brisvalectl alert-agent --json` with its stdin and stdout on pipes.
-class AgentProcess {
- public:
-  explicit AgentProcess(const std::string& root) {
-    int in[2], out[2];
-    if (pipe2(in, O_CLOEXEC) != 0 || pipe2(out, O_CLOEXEC) != 0) return;
-    pid_ = fork();
-    if (pid_ == 0) {
-      dup2(in[0], STDIN_FILENO);
-      dup2(out[1], STDOUT_FILENO);
-      execl(BRISVALECTL, BRISVALECTL, "--root", root.c_str(), "--json", "alert-agent", nullptr);
-      _exit(127);
-    }
-    close(in[0]);
-    close(out[1]);
-    stdin_.Reset(in[1]);
-    stdout_.Reset(out[0]);
-    fcntl(stdout_.get(), F_SETFL, O_NONBLOCK);
-  }
-  ~AgentProcess() {
-    if (pid_ > 0) {
-      kill(pid_, SIGTERM);
-      waitpid(pid_, nullptr, 0);
-    }
-  }
-  void PressEnter() { ASSERT_EQ(write(stdin_.get(), "\n", 1), 1); }
-  // Runs `loop` until the agent prints a line with `"event": "<event>"`; that line.
-  std::string WaitFor(RunLoop& loop, const std::string& event) {
-    const std::string wanted = "\"event\": \"" + event + "\"";
-    for (auto end = std::chrono::steady_clock::now() + 5s; std::chrono::steady_clock::now() < end;) {
-      char buffer[4096];
-      ssize_t got = read(stdout_.get(), buffer, sizeof buffer);
-      if (got > 0) output_.append(buffer, static_cast<size_t>(got));
-      for (size_t newline; (newline = output_.find('\n')) != std::string::npos;) {
-        std::string line = output_.substr(0, newline);
-        output_.erase(0, newline + 1);
-        if (line.find(wanted) != std::string::npos) return line;
-      }
-      loop.RunFor(10ms);
-    }
-    return "(no " + event + " line)";
-  }
-
- private:
-  pid_t pid_ = -1;
-  UniqueFd stdin_, stdout_;
-  std::string output_;
+// A medium the registry never published: adding an interest on it fails.
+struct StrayMedium final : registry::Object {
+  uint64_t EntryId() const override { return 99; }
+  const std::string& ClassName() const override { return name; }
+  bool ConformsTo(std::string_view c) const override { return c == name; }
+  std::optional<plist::Value> Property(std::string_view) const override { return std::nullopt; }
+  registry::Result<plist::Value> CopyProperties() const override { return {}; }
+  registry::Result<registry::ObjectRef> Parent() const override { return {registry::kNoDevice, nullptr}; }
+  std::vector<registry::ObjectRef> Children() const override { return {}; }
+  bool IsTerminated() const override { return false; }
+  std::string name = "KxMedia";
 };
 
-struct AlertAgentTest : ::testing::Test {
-  AlertAgentTest() {
-    char dir[] = "/tmp/brisvale-alerts-XXXXXX";
-    root = ::mkdtemp(dir);
-    std::string error;
-    EXPECT_TRUE(alert::InstallLocalizationBundle(root, &error)) << error;
-    service = alert::CreateLinuxUserAlertService(
-        loop, {root + alert::kAlertAgentSocketPath, root});
-    CurrentServices().alerts = service.get();
+// The real service, but its alerts cannot give a response source.
+struct NoSourceService final : alert::UserAlertService {
+  struct NoSource final : alert::Alert {
+    bool CreateResponseSource(alert::ResponseHandler) override { return false; }
+    void AttachResponseSource(RunLoop&) override {}
+    long Cancel() override { return 0; }
+  };
+  explicit NoSourceService(alert::UserAlertService& real) : real(real) {}
+  std::unique_ptr<alert::Alert> CreateAlert(const alert::Description&, alert::AlertLevel,
+                                            std::optional<std::chrono::seconds>) override {
+    return std::make_unique<NoSource>();
   }
-  ~AlertAgentTest() override { std::filesystem::remove_all(root); }
+  std::optional<plist::Value> CopyPreference(std::string_view key, std::string_view domain,
+                                             std::string_view user) override {
+    return real.CopyPreference(key, domain, user);
+  }
+  std::unique_ptr<alert::Bundle> OpenBundle(std::string_view path) override { return real.OpenBundle(path); }
+  RunLoop& MainLoop() override { return real.MainLoop(); }
+  alert::UserAlertService& real;
+};
 
-  registry::ObjectRef Medium() {
-    return registry.Publish(nullptr, "KxMedia", {{"BSD Name", plist::Value("sdb1")}});
+// The next frame on the agent's end of an alert's connection, decoded; empty on timeout.
+plist::Dictionary ReadFrame(int agent) {
+  uint8_t header[4];
+  if (recv(agent, header, sizeof header, MSG_WAITALL) != 4) return {};
+  plist::Bytes payload(uint32_t{header[0]} << 24 | uint32_t{header[1]} << 16 | uint32_t{header[2]} << 8 | header[3]);
+  if (recv(agent, payload.data(), payload.size(), MSG_WAITALL) != static_cast<ssize_t>(payload.size())) return {};
+  const std::optional<plist::Value> frame = plist::Read(payload);
+  return frame && frame->dictionary() ? *frame->dictionary() : plist::Dictionary{};
+}
+
+struct AlertsTest : ::testing::Test {
+  AlertsTest() {
+    std::string error;
+    EXPECT_TRUE(alert::InstallLocalizationBundle(root.str(), &error)) << error;
   }
+  // Plays the agent: listens where the service looks for one.
+  UniqueFd Listen() {
+    std::string error;
+    UniqueFd listener = ipc::ListenOnPath(root.str() + alert::kAlertAgentSocketPath, &error);
+    EXPECT_TRUE(listener) << error;
+    return listener;
+  }
+  // The agent's end of the next alert's connection, reads bounded by a timeout.
+  static UniqueFd Accept(const UniqueFd& listener, int flags = 0) {
+    UniqueFd agent(accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC | flags));
+    const timeval timeout{5, 0};
+    if (agent) setsockopt(agent.get(), SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
+    return agent;
+  }
+  registry::ObjectRef Medium() { return registry.Publish(nullptr, "KxMedia", {{"BSD Name", plist::Value("sdb1")}}); }
   void ShowMountFailure(const registry::ObjectRef& medium) {
     alerts.Show("MOUNT_FAILURE_TITLE", "MOUNT_FAILURE_BODY", "BUTTON_LABEL", medium);
     loop.RunFor(20ms);
   }
   bool RunUntilAlertDown() { return loop.RunUntil([&] { return !alerts.AlertIsUp(); }, 5s); }
 
-  std::string root;
+  brisvale::testing::ScratchDir root;
   log::CaptureSink log;
   RunLoop loop;
-  std::unique_ptr<alert::UserAlertService> service;
+  std::unique_ptr<alert::UserAlertService> service =
+      alert::CreateLinuxUserAlertService(loop, {root.str() + alert::kAlertAgentSocketPath, root.str()});
   registry::RegistryModel registry;
-  ScopedServices services{Services{&registry, nullptr, nullptr, nullptr, nullptr}};
+  ScopedServices services{Services{&registry, nullptr, nullptr, nullptr, service.get()}};
   UserAlerts alerts;
 };
 
-TEST_F(AlertAgentTest, ConsoleAgentShowsAnswersAndTakesDownAlerts) {
-  AgentProcess agent(root);
-  ASSERT_NE(agent.WaitFor(loop, "listening"), "(no listening line)");
-
-  ShowMountFailure(Medium());
-  std::string shown = agent.WaitFor(loop, "shown");
-  EXPECT_NE(shown.find("\"title\": \"Cannot Use Storage Device\""), std::string::npos) << shown;
-  EXPECT_NE(shown.find("\"button\": \"OK\""), std::string::npos) << shown;
-  agent.PressEnter();
-  EXPECT_TRUE(RunUntilAlertDown());
-  EXPECT_FALSE(alerts.WatchesMedia());
-  EXPECT_NE(agent.WaitFor(loop, "answered"), "(no answered line)");
-
-  registry::ObjectRef medium = Medium();
-  ShowMountFailure(medium);
-  EXPECT_NE(agent.WaitFor(loop, "shown"), "(no shown line)");
-  registry.Terminate(medium);
-  EXPECT_TRUE(RunUntilAlertDown());
-  EXPECT_NE(agent.WaitFor(loop, "cancelled"), "(no cancelled line)");
-  EXPECT_TRUE(log.Lines().empty()) << log.Texts()[0];
-}
-
-// Each agent accepts the alert and then does one thing: says nothing, answers with
-// bytes that are not an answer, answers twice, or hangs up. Then no agent is left.
-TEST_F(AlertAgentTest, MisbehavingAgentsCannotHoldOrConfuseTheAlerts) {
-  const std::string answer = [] {
-    plist::Bytes frame = alert::EncodeResponseFrame(0);
-    return std::string(frame.begin(), frame.end());
-  }();
+// Only a boolean, read once from the domain's own regular file, switches alerts off: a
+// link or a FIFO in its place reads as absent (and the FIFO does not hold the daemon up).
+// With no agent listening, an alert that is tried fails to be created.
+TEST_F(AlertsTest, OnlyABooleanInThePreferenceFileSwitchesAlertsOff) {
+  const std::string file = root.str() + "/var/mobile/Library/Preferences/com.vantrel.mobile.device_o_matic.plist";
+  std::filesystem::create_directories(std::filesystem::path(file).parent_path());
+  const std::string tried = "Failed to create user notification.";
+  const std::string disabled =
+      "Dialogs are disabled because DISABLE_DIALOGS preference was set in com.vantrel.mobile.device_o_matic.";
   struct Case {
     const char* name;
-    std::optional<std::string> sends;  // none: hangs up
-    bool staysUp;
-    std::vector<std::string> lines;
+    std::optional<plist::Value> value;
+    const char* placed;  // "file", "link" or "fifo"
+    Lines lines;
   };
   const Case cases[] = {
-      {"silent", std::string(), true, {}},
-      {"huge frame", std::string("\xff\xff\xff\xff", 4), false,
-       {"Alert agent sent a malformed answer (frame length 4294967295)."}},
-      {"not a property list", std::string("\0\0\0\x05hello", 9), false,
-       {"Alert agent sent a malformed answer (undecodable: too short for a binary property list)."}},
-      {"twice", answer + answer, false, {}},
-      {"hangs up", std::nullopt, false, {"Alert agent closed the connection without an answer."}},
+      {"absent", std::nullopt, "", {tried, tried}},
+      {"false", plist::Value::Bool(false), "file", {tried, tried}},
+      {"true", plist::Value::Bool(true), "file", {disabled, "Dialogs are disabled.", "Dialogs are disabled."}},
+      {"a string", plist::Value("YES"), "file", {tried, tried}},
+      {"a number", plist::Value::Int(1), "file", {tried, tried}},
+      {"true behind a link", plist::Value::Bool(true), "link", {tried, tried}},
+      {"a FIFO", std::nullopt, "fifo", {tried, tried}},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
-    std::string error;
-    UniqueFd listener = ipc::ListenOnPath(root + alert::kAlertAgentSocketPath, &error);
-    ASSERT_TRUE(listener) << error;
-    ShowMountFailure(Medium());
-    ASSERT_TRUE(alerts.AlertIsUp());
-    UniqueFd peer(accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC));
-    ASSERT_TRUE(peer);
+    const std::string written = std::string(c.placed) == "link" ? root.str() + "/elsewhere.plist" : file;
+    if (c.value) std::ofstream(written) << plist::WriteXml(plist::Dictionary{{"DISABLE_DIALOGS", *c.value}});
+    if (std::string(c.placed) == "link") std::filesystem::create_symlink(written, file);
+    if (std::string(c.placed) == "fifo") {
+      ASSERT_EQ(mkfifo(file.c_str(), 0644), 0);
+    }
+    UserAlerts fresh;
     log.Clear();
-    if (c.sends) {
-      ASSERT_EQ(send(peer.get(), c.sends->data(), c.sends->size(), MSG_NOSIGNAL),
-                static_cast<ssize_t>(c.sends->size()));
+    for (int i = 0; i < 2; ++i) {
+      fresh.Show("MOUNT_FAILURE_TITLE", "MOUNT_FAILURE_BODY", "BUTTON_LABEL", nullptr);
+      loop.RunFor(5ms);
+      std::filesystem::remove(file);  // the second alert goes by the first reading
+    }
+    EXPECT_EQ(log.Texts(), c.lines);
+  }
+  EXPECT_EQ(service->CopyPreference("DISABLE_DIALOGS", "../../../elsewhere", "mobile"), std::nullopt);
+}
+
+TEST_F(AlertsTest, FailuresShowNothingAndLeaveNoAlert) {
+  const auto showsOnly = [&](const std::string& line) {
+    log.Clear();
+    ShowMountFailure(Medium());
+    EXPECT_EQ(log.Lines(), (std::vector<log::Line>{{Level::Default, line}}));
+    EXPECT_FALSE(alerts.AlertIsUp() || alerts.WatchesMedia());
+  };
+  showsOnly("Failed to create user notification.");  // no agent
+  {
+    NoSourceService noSource(*service);
+    ScopedServices scoped(Services{&registry, nullptr, nullptr, nullptr, &noSource});
+    showsOnly("Failed to create runloop source for user notification.");
+  }
+  std::filesystem::remove_all(root / "System");
+  showsOnly("Failed to create bundle.");
+}
+
+// Each agent takes the alert and then does one thing. Whatever it does, the next request
+// is still served: dropped while the alert is up, tried (with no agent left) once it is gone.
+TEST_F(AlertsTest, OneAlertAtATimeUntilWhatTheAgentDoesTakesItDown) {
+  const plist::Bytes frame = alert::EncodeResponseFrame(0);
+  const std::string answer(frame.begin(), frame.end());
+  const plist::Dictionary shown{
+      {"Type", plist::Value("Show")}, {"TopMost", plist::Value::Bool(true)}, {"Level", plist::Value::Int(0)},
+      {"Timeout", plist::Value::Int(0)}, {"Title", plist::Value("NO_TEXT_TITLE")},  // a key without a text
+      {"Message", plist::Value("The connected storage device could not be opened. Its format may not be supported "
+                               "here. Reformat it on a computer, then connect it again.")}};
+  enum Action { kSends, kHangsUp, kMediumPulled, kMediumPulledAfterAgentStoppedReading };
+  struct Case {
+    const char* name;
+    Action action;
+    std::string sends;
+    bool staysUp;
+    Lines lines;
+  };
+  const Case cases[] = {
+      {"answers", kSends, answer, false, {}},
+      {"answers twice", kSends, answer + answer, false, {}},
+      {"silent", kSends, "", true, {}},
+      {"huge frame", kSends, std::string("\xff\xff\xff\xff", 4), false,
+       {"Alert agent sent a malformed answer (frame length 4294967295)."}},
+      {"not a property list", kSends, std::string("\0\0\0\x05hello", 9), false,
+       {"Alert agent sent a malformed answer (undecodable: too short for a binary property list)."}},
+      {"hangs up", kHangsUp, "", false, {"Alert agent closed the connection without an answer."}},
+      {"medium pulled", kMediumPulled, "", false, {}},
+      {"medium pulled, agent not reading", kMediumPulledAfterAgentStoppedReading, "", false,
+       {"Failed to cancel user notification: -32"}},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    UniqueFd listener = Listen();
+    const registry::ObjectRef medium = Medium();
+    log.Clear();
+    alerts.Show("NO_TEXT_TITLE", "MOUNT_FAILURE_BODY", nullptr, medium);
+    alerts.Show("MOUNT_FAILURE_TITLE", "MOUNT_FAILURE_BODY", "BUTTON_LABEL", medium);
+    EXPECT_FALSE(Accept(listener, SOCK_NONBLOCK)) << "shown before the main loop ran";
+    loop.RunFor(20ms);
+    UniqueFd agent = Accept(listener);
+    EXPECT_EQ(ReadFrame(agent.get()), shown);
+    EXPECT_EQ(log.Lines(), (std::vector<log::Line>{{Level::Debug, "Dialog already up, one is enough."}}));
+    ASSERT_TRUE(alerts.AlertIsUp() && alerts.WatchesMedia());
+    log.Clear();
+    if (c.action == kSends) {
+      ASSERT_EQ(send(agent.get(), c.sends.data(), c.sends.size(), MSG_NOSIGNAL), static_cast<ssize_t>(c.sends.size()));
+    } else if (c.action == kHangsUp) {
+      agent.Reset();
     } else {
-      peer.Reset();
+      if (c.action == kMediumPulledAfterAgentStoppedReading) shutdown(agent.get(), SHUT_RD);
+      registry.Terminate(medium);
     }
     loop.RunFor(50ms);
     EXPECT_EQ(alerts.AlertIsUp(), c.staysUp);
+    EXPECT_EQ(alerts.WatchesMedia(), c.staysUp);
     EXPECT_EQ(log.Texts(), c.lines);
-    // The next request is still served: dropped while one is up, and tried (with no
-    // agent left to show it) once it is gone.
+    if (c.action == kMediumPulled) {
+      EXPECT_EQ(*ReadFrame(agent.get()).find("Type"), plist::Value("Cancel"));
+    } else if (c.action == kSends && !c.staysUp) {
+      registry.Terminate(medium);  // the watch went with the answer: nothing to cancel
+      loop.RunFor(20ms);
+      EXPECT_EQ(ReadFrame(agent.get()), plist::Dictionary{});
+    }
+
     listener.Reset();
     alerts.Show("MOUNT_FAILURE_TITLE", nullptr, nullptr, nullptr);
     loop.RunFor(20ms);
-    EXPECT_EQ(log.Texts().back(), c.staysUp ? "Dialog already up, one is enough."
-                                            : "Failed to create user notification.")
-        << "after " << c.name;
+    EXPECT_EQ(log.Texts().back(), c.staysUp ? "Dialog already up, one is enough." : "Failed to create user notification.");
     if (c.staysUp) {
-      peer.Reset();  // the silent agent finally goes away
+      agent.Reset();  // the silent agent finally goes away
       ASSERT_TRUE(RunUntilAlertDown());
     }
   }
 }
 
-// Only a regular file is read: a link or a FIFO planted in its place reads as absent
-// (and the FIFO does not hold the daemon up).
-TEST_F(AlertAgentTest, PreferenceComesFromTheDomainFileOnly) {
-  const std::string directory = root + "/var/mobile/Library/Preferences";
-  const std::string file = directory + "/com.vantrel.mobile.device_o_matic.plist";
-  std::filesystem::create_directories(directory);
-  auto read = [&] {
-    return service->CopyPreference("DISABLE_DIALOGS", "com.vantrel.mobile.device_o_matic", "mobile");
-  };
-  EXPECT_EQ(read(), std::nullopt);
-  ASSERT_EQ(mkfifo(file.c_str(), 0644), 0);
-  EXPECT_EQ(read(), std::nullopt);
-  std::filesystem::remove(file);
-  const std::string real = root + "/elsewhere.plist";
-  std::ofstream(real) << plist::WriteXml(
-      plist::Dictionary{{"DISABLE_DIALOGS", plist::Value::Bool(true)}});
-  std::filesystem::create_symlink(real, file);
-  EXPECT_EQ(read(), std::nullopt);
-  std::filesystem::rename(real, file);
-  EXPECT_EQ(read(), plist::Value::Bool(true));
-  EXPECT_EQ(service->CopyPreference("DISABLE_DIALOGS", "../../../elsewhere", "mobile"), std::nullopt);
+TEST_F(AlertsTest, FailedRemovalWatchLeavesTheAlertUpUntilAnswered) {
+  UniqueFd listener = Listen();
+  ShowMountFailure(std::make_shared<StrayMedium>());
+  EXPECT_EQ(log.Lines(), (std::vector<log::Line>{{Level::Default, "KxServiceAddInterestNotification failed: 0x02c2"}}));
+  EXPECT_TRUE(alerts.AlertIsUp());
+  EXPECT_FALSE(alerts.WatchesMedia());
+  const plist::Bytes answer = alert::EncodeResponseFrame(0);
+  EXPECT_EQ(send(Accept(listener).get(), answer.data(), answer.size(), MSG_NOSIGNAL), static_cast<ssize_t>(answer.size()));
+  EXPECT_TRUE(RunUntilAlertDown());
 }
 
 }  // namespace

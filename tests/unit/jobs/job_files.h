@@ -1,27 +1,20 @@
-// A temporary directory tree for the job tests, removed with everything in it.
+// Job files for the job tests: a scratch tree that writes property lists, and a job.
 #pragma once
 
-#include <unistd.h>
-
 #include <filesystem>
-#include <fstream>
 #include <string>
 
 #include "base/plist.h"
+#include "test_files.h"
 
 namespace brisvale::testing {
 
-struct TempTree {
-  std::string pattern = "/tmp/brisvale-jobs-XXXXXX";
-  std::filesystem::path root = ::mkdtemp(pattern.data());
-  ~TempTree() { std::filesystem::remove_all(root); }
-
+struct JobTree : ScratchDir {
   // Writes `value` at `relative`, parents created, as a binary or XML property list.
   void Write(const std::string& relative, const plist::Value& value, bool xml = false) const {
-    std::filesystem::create_directories((root / relative).parent_path());
-    const plist::Bytes bytes = xml ? plist::Bytes() : plist::WriteBinary(value);
-    std::ofstream(root / relative, std::ios::binary)
-        << (xml ? plist::WriteXml(value) : std::string(bytes.begin(), bytes.end()));
+    std::filesystem::create_directories((*this / relative).parent_path());
+    const std::string text = xml ? plist::WriteXml(value) : std::string();
+    WriteFileBytes(*this / relative, xml ? plist::Bytes(text.begin(), text.end()) : plist::WriteBinary(value));
   }
 };
 

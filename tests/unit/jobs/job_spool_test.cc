@@ -1,3 +1,4 @@
+// The job spool launcher (platform/linux/jobs_spool): labels refused, and no half-written job.
 #include "platform/linux/jobs_spool.h"
 
 #include <gtest/gtest.h>
@@ -21,8 +22,8 @@ std::vector<std::string> Entries(const std::filesystem::path& directory) {
 }
 
 TEST(JobSpool, RefusesBadAndDuplicateLabelsWithoutWriting) {
-  testing::TempTree tree;
-  SpoolJobLauncher launcher((tree.root / "jobs").string());
+  testing::JobTree tree;
+  SpoolJobLauncher launcher((tree.path() / "jobs").string());
   const Dictionary loaded{{"Label", "com.x.agent"}, {"Program", "/bin/first"}};
   ASSERT_EQ(launcher.Submit(loaded), std::nullopt);
   const std::pair<std::optional<Value>, const char*> cases[] = {
@@ -42,17 +43,17 @@ TEST(JobSpool, RefusesBadAndDuplicateLabelsWithoutWriting) {
     const std::optional<LaunchError> error = launcher.Submit(job);
     EXPECT_EQ(error ? error->description : "submitted", description);
   }
-  const auto spooled = ReadJobSpool((tree.root / "jobs").string(), nullptr);
+  const auto spooled = ReadJobSpool((tree.path() / "jobs").string(), nullptr);
   ASSERT_TRUE(spooled && spooled->size() == 1);
   EXPECT_EQ(spooled->front().job, loaded);
-  EXPECT_EQ(Entries(tree.root / "jobs"), std::vector<std::string>{"com.x.agent"});
+  EXPECT_EQ(Entries(tree.path() / "jobs"), std::vector<std::string>{"com.x.agent"});
 }
 
 // A write that stops part-way (here at the file-size limit) must leave nothing a reader
 // could take for the job.
 TEST(JobSpool, HalfWrittenJobNeverShows) {
-  testing::TempTree tree;
-  SpoolJobLauncher launcher((tree.root / "jobs").string());
+  testing::JobTree tree;
+  SpoolJobLauncher launcher((tree.path() / "jobs").string());
   const Dictionary big{{"Label", "big"}, {"Data", Value(plist::Bytes(64 << 10, 1))}};
   rlimit saved;
   ASSERT_EQ(::getrlimit(RLIMIT_FSIZE, &saved), 0);
@@ -66,7 +67,7 @@ TEST(JobSpool, HalfWrittenJobNeverShows) {
 
   ASSERT_TRUE(error);
   EXPECT_EQ(error->description, "cannot write the job file: File too large");
-  EXPECT_TRUE(Entries(tree.root / "jobs").empty());
+  EXPECT_TRUE(Entries(tree.path() / "jobs").empty());
   EXPECT_EQ(launcher.Submit(big), std::nullopt);
 }
 

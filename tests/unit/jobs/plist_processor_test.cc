@@ -1,3 +1,4 @@
+// Job property lists (jobs/plist_processor): program verification, factory rewrite and the scan.
 #include "jobs/plist_processor.h"
 
 #include <gtest/gtest.h>
@@ -86,21 +87,21 @@ TEST(PlistProcessor, RewritesFactoryJobsToTheRealMountPoint) {
 }
 
 TEST(PlistProcessor, ScanFindsJobListsAtAnyDepthAndNothingElse) {
-  testing::TempTree image, outside;
+  testing::JobTree image, outside;
   outside.Write("escaped.plist", Value(Job("escaped", Args({"/x"}))));
   image.Write("jobs/a.plist", Value(Job("a", Args({"/x"}))), /*xml=*/true);
   image.Write("jobs/sub/.hidden", Value(Job("b", Args({"/x"}))));
   image.Write("jobs/array.plist", Args({"/x"}));
-  std::ofstream(image.root / "jobs/notes.txt") << "plain text";
-  std::filesystem::create_directory_symlink(outside.root, image.root / "jobs/link");
-  std::filesystem::create_symlink(outside.root / "escaped.plist", image.root / "jobs/file-link");
-  ASSERT_EQ(::mkfifo((image.root / "jobs/fifo").c_str(), 0600), 0);
-  std::filesystem::create_directory_symlink(image.root / "jobs", image.root / "jobs-link");
+  std::ofstream(image.path() / "jobs/notes.txt") << "plain text";
+  std::filesystem::create_directory_symlink(outside.path(), image.path() / "jobs/link");
+  std::filesystem::create_symlink(outside.path() / "escaped.plist", image.path() / "jobs/file-link");
+  ASSERT_EQ(::mkfifo((image.path() / "jobs/fifo").c_str(), 0600), 0);
+  std::filesystem::create_directory_symlink(image.path() / "jobs", image.path() / "jobs-link");
 
   ScopedServices services(Services{.os = &os::SystemOs()});
   const auto labels = [&](const char* directory, bool goOn) {
     std::multiset<std::string> seen;
-    Processor().scanPlists((image.root / directory).string(), [&](const Dictionary& job) {
+    Processor().scanPlists((image.path() / directory).string(), [&](const Dictionary& job) {
       seen.insert(*job.find("Label")->string());
       return goOn;
     });

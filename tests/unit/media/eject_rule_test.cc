@@ -7,6 +7,7 @@
 #include <fstream>
 
 #include "platform/linux/os_system.h"
+#include "test_files.h"
 
 namespace brisvale::os {
 namespace {
@@ -14,7 +15,7 @@ namespace {
 namespace fs = std::filesystem;
 
 TEST(EjectRuleTest, DiskEjectedOnlyWhenNoPartitionIsMounted) {
-  const fs::path root = fs::temp_directory_path() / ("eject-rule-" + std::to_string(getpid()));
+  const brisvale::testing::ScratchDir root;
   const fs::path disk = root / "devices/usb/block/sdb";
   for (const char* name : {"sdb1", "sdb2"}) fs::create_directories(disk / name);
   std::ofstream(disk / "sdb1/partition") << 1;
@@ -32,10 +33,9 @@ TEST(EjectRuleTest, DiskEjectedOnlyWhenNoPartitionIsMounted) {
                         Case{"8:18", makedev(7, 3), false}}) {
     std::ofstream(root / "mountinfo") << "21 1 254:0 / / rw - ext4 /dev/vda rw\n"
                                       << "40 21 " << c.mountedDevice << " / /mnt rw - hfsplus x rw\n";
-    EXPECT_EQ(DiskHasMountedPartition(c.ejected, root.string(), (root / "mountinfo").string()), c.refused)
+    EXPECT_EQ(DiskHasMountedPartition(c.ejected, root.str(), (root / "mountinfo").string()), c.refused)
         << c.mountedDevice << " " << major(c.ejected) << ":" << minor(c.ejected);
   }
-  fs::remove_all(root);
 }
 
 }  // namespace
