@@ -14,7 +14,7 @@ namespace {
 
 namespace fs = std::filesystem;
 
-TEST(EjectRuleTest, DiskEjectedOnlyWhenNoPartitionIsMounted) {
+TEST(EjectRuleTest, MadeUpPartitionLayout) {
   const brisvale::testing::ScratchDir root;
   const fs::path disk = root / "devices/usb/block/sdb";
   for (const char* name : {"sdb1", "sdb2"}) fs::create_directories(disk / name);
