@@ -33,7 +33,11 @@ using ::testing::IsEmpty;
 class TreeOs : public testing::FakeOs {
  public:
   int Unlink(const char* path) override { return real.Unlink(path); }
-  os::DirectoryListing ReadDirectory(const char* path) override { return real.ReadDirectory(path); }
+  os::DirectoryListing ReadDirectory(const char* path) override {
+    os::DirectoryListing listing = real.ReadDirectory(path);
+    if (listing.openError == 0) listing.closeError = closeError;
+    return listing;
+  }
   int RealPath(const char* path, std::string& resolved) override { return real.RealPath(path, resolved); }
   int ClearFlags(const char* path) override { return real.ClearFlags(path); }
   os::TreeWalk WalkTree(const char* root, const std::function<bool(const os::TreeNode&)>& visit) override {
@@ -43,6 +47,7 @@ class TreeOs : public testing::FakeOs {
   int RemoveDirectoryAt(int dir, const char* name) override { return real.RemoveDirectoryAt(dir, name); }
   int ClearFlagsAt(int dir, const char* name) override { return real.ClearFlagsAt(dir, name); }
   os::LinuxOs real;
+  int closeError = 0;  // what closing a directory that was read answers
 };
 
 // Makes `depth` nested directories named "d" below `top`, without any path limit.
@@ -115,6 +120,12 @@ TEST_F(StaleMountPointsTest, MissingRootIsSilentOtherFailuresAreLogged) {
   std::ofstream(base / "file") << "x";
   RemoveStaleMountPoints((base / "file").c_str());
   EXPECT_THAT(capture.Texts(), ElementsAre("Failed to open " + (base / "file").string() + ": 20"));
+  // A root that was read, even an empty one, failed to close and not to open.
+  capture.Clear();
+  os.closeError = -EIO;
+  RemoveStaleMountPoints(root.c_str());
+  EXPECT_THAT(capture.Texts(), ElementsAre("Failed to close " + root.string() + ": 5"));
+  os.closeError = 0;
 
   capture.Clear();
   EXPECT_EQ(RemoveTree((base / "absent").c_str(), 1), 0);  // nothing to walk is nothing to remove
