@@ -108,20 +108,22 @@ void RunLoop::Post(Task task) {
 }
 
 SourceHandle RunLoop::AddFd(int fd, uint32_t events, FdCallback callback) {
-  const int duplicate = ::fcntl(fd, F_DUPFD_CLOEXEC, 0);
-  if (duplicate < 0) return {};
-  return AddSource(duplicate, true, events, std::move(callback));
+  auto source = std::make_shared<Source>();
+  source->fd = ::fcntl(fd, F_DUPFD_CLOEXEC, 0);
+  if (source->fd < 0) return {};
+  source->onReady = std::move(callback);
+  return Register(std::move(source), events);
 }
 
 SourceHandle RunLoop::WatchFd(int fd, uint32_t events, FdCallback callback) {
-  return AddSource(fd, false, events, std::move(callback));
-}
-
-SourceHandle RunLoop::AddSource(int fd, bool owned, uint32_t events, FdCallback callback) {
   auto source = std::make_shared<Source>();
   source->fd = fd;
-  source->owned = owned;
+  source->owned = false;
   source->onReady = std::move(callback);
+  return Register(std::move(source), events);
+}
+
+SourceHandle RunLoop::Register(std::shared_ptr<Source> source, uint32_t events) {
   uint64_t id = nextId_++;
   epoll_event event{};
   event.events = events;
@@ -163,13 +165,7 @@ SourceHandle RunLoop::AddTimer(std::chrono::milliseconds delay, Task task) {
   if (source->fd < 0) return {};
   itimerspec timer = TimerSpec(delay, std::chrono::milliseconds::zero());
   if (::timerfd_settime(source->fd, 0, &timer, nullptr) < 0) return {};
-  uint64_t id = nextId_++;
-  epoll_event event{};
-  event.events = EPOLLIN;
-  event.data.u64 = id;
-  if (::epoll_ctl(epollFd_, EPOLL_CTL_ADD, source->fd, &event) < 0) return {};
-  sources_.emplace(id, std::move(source));
-  return SourceHandle(this, id);
+  return Register(std::move(source), EPOLLIN);
 }
 
 SourceHandle RunLoop::AddRepeatingTimer(std::chrono::milliseconds interval, Task task) {

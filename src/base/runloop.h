@@ -86,7 +86,7 @@ class RunLoop {
   friend class SourceHandle;
   struct Source;
   void Remove(uint64_t id);
-  SourceHandle AddSource(int fd, bool owned, uint32_t events, FdCallback callback);
+  SourceHandle Register(std::shared_ptr<Source> source, uint32_t events);
   // Handles what is ready (waiting up to timeoutMs for something), returning early once
   // `done` says so; what is left stays pending for the next call.
   int Dispatch(int timeoutMs, const std::function<bool()>* done = nullptr);
