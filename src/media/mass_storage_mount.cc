@@ -27,24 +27,14 @@ int StatMountedFilesystem(os::Os& system, const std::string& mountPath, os::Moun
   std::string canonical;
   if (const int error = system.RealPath(mountPath.c_str(), canonical); error < 0) return error;
   std::vector<os::MountRecord> table;
-  for (int attempt = 0; attempt < 3; ++attempt) {
-    const int count = system.GetMountTable({});
-    if (count < 0) return count;
-    table.resize(static_cast<size_t>(count) + 8);  // room for mounts made in between
-    const int filled = system.GetMountTable(table);
-    if (filled < 0) return filled;
-    if (static_cast<size_t>(filled) < table.size()) {
-      table.resize(static_cast<size_t>(filled));
-      for (auto it = table.rbegin(); it != table.rend(); ++it) {
-        if (it->mountedOn == canonical) {
-          record = *it;
-          return 0;
-        }
-      }
-      return -EINVAL;  // nothing is mounted there
+  if (const int filled = os::CopyMountTable(system, table); filled < 0) return filled;
+  for (auto it = table.rbegin(); it != table.rend(); ++it) {
+    if (it->mountedOn == canonical) {
+      record = *it;
+      return 0;
     }
   }
-  return -EAGAIN;
+  return -EINVAL;  // nothing is mounted there
 }
 
 std::optional<std::string> AnnounceMount(std::string_view deviceNode, const os::MountRecord& record) {
