@@ -8,11 +8,11 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstdio>
 #include <cstring>
 #include <utility>
 
 #include "base/unique_fd.h"
+#include "platform/linux/os_system.h"
 
 namespace brisvale::loop {
 namespace {
@@ -27,14 +27,8 @@ int Errno() { return errno ? -errno : -EIO; }
 // The device number sysfs gives the loop device: its minor depends on how many
 // partitions the driver reserves per device.
 dev_t LoopDeviceNumber(int number) {
-  const std::string path = "/sys/block/loop" + std::to_string(number) + "/dev";
-  unsigned major = 0, minor = 0;
-  if (FILE* file = std::fopen(path.c_str(), "re")) {
-    const int read = std::fscanf(file, "%u:%u", &major, &minor);
-    std::fclose(file);
-    if (read == 2) return makedev(major, minor);
-  }
-  return makedev(kLoopMajor, static_cast<unsigned>(number));
+  const dev_t device = os::ReadDeviceNumberFile("/sys/block/loop" + std::to_string(number) + "/dev");
+  return device != 0 ? device : makedev(kLoopMajor, static_cast<unsigned>(number));
 }
 
 // Opens loop device `number` through the device root, making its node for the open

@@ -4,7 +4,6 @@
 // a disk is ejected only once none of its partitions is mounted.
 #include <sys/sysmacros.h>
 
-#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <set>
@@ -21,16 +20,15 @@ std::string DeviceNumberText(dev_t device) {
   return std::to_string(major(device)) + ":" + std::to_string(minor(device));
 }
 
-// The device number a sysfs directory's "dev" file holds as "major:minor"; 0 if unreadable.
-dev_t PartitionDevice(const fs::path& partition) {
+}  // namespace
+
+dev_t ReadDeviceNumberFile(const std::string& path) {
   unsigned int majorNumber = 0, minorNumber = 0;
-  std::ifstream numberFile(partition / "dev");
+  std::ifstream numberFile(path);
   char colon = 0;
   if (!(numberFile >> majorNumber >> colon >> minorNumber) || colon != ':') return 0;
   return makedev(majorNumber, minorNumber);
 }
-
-}  // namespace
 
 bool DiskHasMountedPartition(dev_t device, const std::string& sysRoot, const std::string& mountInfoPath) {
   std::error_code error;
@@ -42,7 +40,7 @@ bool DiskHasMountedPartition(dev_t device, const std::string& sysRoot, const std
   if (ReadMountedDevices(mountInfoPath.c_str(), mounted) < 0) return false;
   for (fs::directory_iterator entry(disk, error), end; !error && entry != end; entry.increment(error)) {
     std::error_code ignored;
-    if (fs::exists(entry->path() / "partition", ignored) && mounted.count(PartitionDevice(entry->path()))) return true;
+    if (fs::exists(entry->path() / "partition", ignored) && mounted.count(ReadDeviceNumberFile(entry->path() / "dev"))) return true;
   }
   return false;
 }

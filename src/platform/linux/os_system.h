@@ -75,6 +75,9 @@ class LinuxOs final : public Os {
 bool DiskHasMountedPartition(dev_t device, const std::string& sysRoot = "/sys",
                              const std::string& mountInfoPath = "/proc/self/mountinfo");
 
+// The device number a sysfs "dev" file holds as "major:minor"; 0 when unreadable.
+dev_t ReadDeviceNumberFile(const std::string& path);
+
 // GetMountTable over a table in the kernel's mountinfo format at `path`.
 int ReadMountTable(const char* path, std::span<MountRecord> records);
 // The whole table at `path`, fields uncut (for the sandbox, which must name every
