@@ -21,9 +21,18 @@ ctl=build/tools/brisvalectl/brisvalectl
 sandbox=$(mktemp -d /tmp/brisvale-demo.XXXXXX)
 log="$sandbox.log"
 daemon_pid=""
+start_daemon() {
+  "$daemon" --root "$sandbox" --devices /devices.plist --verbose >"$log" 2>&1 &
+  daemon_pid=$!
+}
+stop_daemon() {
+  [[ -n "$daemon_pid" ]] && kill "$daemon_pid" 2>/dev/null && wait "$daemon_pid" 2>/dev/null || true
+}
+# scripts/check-unit.sh runs the demo with the daemon started by its service unit.
+[[ -n "${BRISVALE_UNIT_DIR:-}" ]] && source scripts/unit-daemon.sh
 
 cleanup() {
-  [[ -n "$daemon_pid" ]] && kill "$daemon_pid" 2>/dev/null && wait "$daemon_pid" 2>/dev/null || true
+  stop_daemon
   "$daemon" --root "$sandbox" --teardown || true
   rm -f "$log"
 }
@@ -56,8 +65,7 @@ cat >"$sandbox/devices.plist" <<'PLIST'
 PLIST
 
 echo "Sandbox root: $sandbox"
-"$daemon" --root "$sandbox" --devices /devices.plist --verbose >"$log" 2>&1 &
-daemon_pid=$!
+start_daemon
 for _ in $(seq 100); do
   [[ -S "$sandbox/private/var/run/vexa/com.vantrel.brisvale_mounter.vexa" ]] && break
   sleep 0.05

@@ -5,9 +5,7 @@
 // size are bounded, so a hostile tree costs bounded memory and time.
 #include <dirent.h>
 #include <fcntl.h>
-#include <linux/openat2.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -34,15 +32,6 @@ struct OpenDirectory {
   UniqueDir dir;
   std::string prefix;  // relative path of this directory, "" or ending in "/"
 };
-
-// The start directory, refusing a link anywhere on the way.
-int OpenStart(const char* directory) {
-  open_how how{};
-  how.flags = O_RDONLY | O_DIRECTORY | O_CLOEXEC;
-  how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS;
-  const long fd = ::syscall(SYS_openat2, AT_FDCWD, directory, &how, sizeof how);
-  return fd < 0 ? -errno : static_cast<int>(fd);
-}
 
 // The kind of `name`, asked of the file system only when the directory does not say.
 unsigned char EntryType(int dirFd, const dirent& entry) {
@@ -90,7 +79,8 @@ UniqueDir OpenSubdirectory(int dirFd, const char* name, dev_t device) {
 
 int LinuxOs::ReadFilesBelow(const char* directory, size_t maxFileBytes,
                             const std::function<bool(const FoundFile&)>& visit) {
-  const int startFd = OpenStart(directory);
+  // The start directory, refusing a link anywhere on the way.
+  const int startFd = OpenDirectoryNoLinks(directory);
   if (startFd < 0) return startFd;
   UniqueFd start(startFd);
   struct stat st;

@@ -75,6 +75,10 @@ class LinuxOs final : public Os {
 bool DiskHasMountedPartition(dev_t device, const std::string& sysRoot = "/sys",
                              const std::string& mountInfoPath = "/proc/self/mountinfo");
 
+// Opens the directory `path` for reading, refusing a symbolic link at any step on the
+// way (os_tree.cc); -errno on failure. `byComponents` skips the single-call form, for tests.
+int OpenDirectoryNoLinks(const char* path, bool byComponents = false);
+
 // The device number a sysfs "dev" file holds as "major:minor"; 0 when unreadable.
 dev_t ReadDeviceNumberFile(const std::string& path);
 

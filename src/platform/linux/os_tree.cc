@@ -14,6 +14,8 @@
 #include <climits>
 #include <cstdlib>
 #include <memory>
+#include <string>
+#include <string_view>
 
 #include "base/unique_fd.h"
 #include "platform/linux/os_system.h"
@@ -34,16 +36,38 @@ unsigned char TypeAt(int dirFd, const char* name) {
   return S_ISLNK(status.st_mode) ? DT_LNK : DT_REG;
 }
 
+// One component at a time, each opened O_NOFOLLOW relative to the one before, so a
+// link anywhere on the way is refused just as the single call refuses it.
+int OpenByComponents(const char* path) {
+  UniqueFd dir(::open(path[0] == '/' ? "/" : ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
+  if (!dir) return -errno;
+  std::string_view rest = path;
+  while (!rest.empty()) {
+    const size_t slash = rest.find('/');
+    const std::string component(rest.substr(0, slash));
+    rest = slash == std::string_view::npos ? std::string_view() : rest.substr(slash + 1);
+    if (component.empty()) continue;
+    UniqueFd next(::openat(dir.get(), component.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    if (!next) {
+      // A link fails here as "not a directory"; the single call says so only for the
+      // last component and "too many links" for one on the way.
+      const int error = errno;
+      const bool last = rest.find_first_not_of('/') == std::string_view::npos;
+      struct stat status {};
+      const bool link = ::fstatat(dir.get(), component.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 &&
+                        S_ISLNK(status.st_mode);
+      return link && !last ? -ELOOP : -error;
+    }
+    dir = std::move(next);
+  }
+  const int fd = ::openat(dir.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  return fd >= 0 ? fd : -errno;
+}
+
 // Directories by descriptor, for the tree walk.
 class LinuxDirectories final : public DirectoryAccess {
  public:
-  int OpenPath(const char* path) override {
-    open_how how{};
-    how.flags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
-    how.resolve = RESOLVE_NO_SYMLINKS;
-    const long fd = ::syscall(SYS_openat2, AT_FDCWD, path, &how, sizeof how);
-    return fd >= 0 ? static_cast<int>(fd) : -errno;
-  }
+  int OpenPath(const char* path) override { return OpenDirectoryNoLinks(path); }
   int OpenChild(int dir, const char* name) override {
     const int fd = ::openat(dir, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
     return fd >= 0 ? fd : -errno;
@@ -88,6 +112,20 @@ class LinuxDirectories final : public DirectoryAccess {
 int Status(int rc) { return rc == 0 ? 0 : -errno; }
 
 }  // namespace
+
+int OpenDirectoryNoLinks(const char* path, bool byComponents) {
+  if (!byComponents) {
+    open_how how{};
+    how.flags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+    how.resolve = RESOLVE_NO_SYMLINKS;
+    const long fd = ::syscall(SYS_openat2, AT_FDCWD, path, &how, sizeof how);
+    if (fd >= 0) return static_cast<int>(fd);
+    // Kernels before 5.6 lack the call, and a seccomp filter that cannot look inside
+    // its argument structure (the service unit's RestrictSUIDSGID=) answers ENOSYS.
+    if (errno != ENOSYS) return -errno;
+  }
+  return OpenByComponents(path);
+}
 
 DirectoryListing LinuxOs::ReadDirectory(const char* path) {
   DirectoryListing listing;

@@ -1,0 +1,32 @@
+#!/usr/bin/env bash
+# Runs the demo with the daemon under its systemd service unit, so that every hardening
+# option there (system-call filter, device access, capabilities) meets the daemon's
+# real work: image and volume mounts, loop devices, tools, alerts. The service manager
+# boots in new PID and mount namespaces of its own, so this works on a machine whose
+# init is not systemd, and nothing it mounts is seen outside. Needs root and systemd.
+set -euo pipefail
+cd "$(dirname "$0")/.."
+[[ $(id -u) -eq 0 ]] || { echo "check-unit.sh: run as root" >&2; exit 1; }
+[[ -x /lib/systemd/systemd ]] || { echo "check-unit.sh: systemd is not installed" >&2; exit 1; }
+[[ -x build/src/daemon/brisvale-mounterd ]] || BUILD_DIR=build scripts/build.sh -DBRISVALE_BENCH=OFF >/dev/null
+
+units=$(mktemp -d /tmp/brisvale-units.XXXXXX)
+printf '[Unit]\nDescription=the unit check\nDefaultDependencies=no\n' >"$units/brisvale-check.target"
+setsid unshare --pid --fork --mount --propagation private --mount-proc \
+  env SYSTEMD_UNIT_PATH="$units" container=brisvale-check \
+  /lib/systemd/systemd --system --unit=brisvale-check.target >/dev/null 2>&1 &
+manager=""
+finish() {
+  # Killing the namespace's first process ends every process left in it.
+  [[ -n "$manager" ]] && kill -KILL "$manager" 2>/dev/null
+  rm -rf "$units"
+}
+trap finish EXIT
+for _ in $(seq 100); do
+  manager=$(pgrep -f -x "/lib/systemd/systemd --system --unit=brisvale-check.target" || true)
+  [[ -n "$manager" ]] && nsenter -t "$manager" -a systemctl is-system-running >/dev/null 2>&1 && break
+  sleep 0.1
+done
+[[ -n "$manager" ]] || { echo "check-unit.sh: the service manager did not start" >&2; exit 1; }
+
+nsenter -t "$manager" -a --wd="$PWD" env BRISVALE_UNIT_DIR="$units" BRISVALE_DEMO_BUILT=1 scripts/demo.sh
