@@ -10,6 +10,8 @@ start_daemon() {
       dist/systemd/brisvale-mounterd.service.in >"$unit"
   printf '%s\n' "StandardOutput=append:$log" "StandardError=append:$log" \
     "DeviceAllow=char-misc rwm" "DeviceAllow=char-mem rwm" >>"$unit"
+  # A stale tree left by an earlier run, for the start-up clean-up's walk.
+  mkdir -p "$sandbox/private/var/mnt/stale/a" && echo x >"$sandbox/private/var/mnt/stale/a/file"
   systemctl daemon-reload
   systemctl start brisvale-mounterd.service
 }
