@@ -3,8 +3,6 @@
 
 #include <blkid/blkid.h>
 #include <fcntl.h>
-#include <linux/loop.h>
-#include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <unistd.h>
@@ -17,6 +15,8 @@
 
 #include "base/c_handle.h"
 #include "base/log.h"
+#include "platform/linux/format_attach_request.h"
+#include "platform/linux/loop_device.h"
 
 namespace brisvale::registry::sysfs {
 namespace {
@@ -64,25 +64,12 @@ std::optional<PartitionTable> ProbePartitionTable(const std::string& node) {
   return table;
 }
 
-bool IsUuidText(std::string_view text) {
-  if (text.size() != 36) return false;
-  for (size_t i = 0; i < text.size(); ++i) {
-    bool dash = i == 8 || i == 13 || i == 18 || i == 23;
-    if (dash ? text[i] != '-' : !std::isxdigit(static_cast<unsigned char>(text[i]))) {
-      return false;
-    }
-  }
-  return true;
-}
-
 std::optional<std::string> ReadLoopIdentifier(const std::string& node) {
   Fd fd(open(node.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
-  if (fd.get() < 0) return std::nullopt;
-  loop_info64 info{};
-  if (ioctl(fd.get(), LOOP_GET_STATUS64, &info) != 0) return std::nullopt;
-  const char* name = reinterpret_cast<const char*>(info.lo_file_name);
-  std::string text(name, strnlen(name, sizeof info.lo_file_name));
-  if (!IsUuidText(text)) return std::nullopt;
+  std::string text;
+  if (fd.get() < 0 || loop::ReadIdentifier(fd.get(), text) < 0 || !formats::IsUuidText(text)) {
+    return std::nullopt;
+  }
   return text;
 }
 

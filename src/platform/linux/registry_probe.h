@@ -30,7 +30,6 @@ std::string PartitionContent(const char* gptTypeGuid, int mbrType);
 // The unique identifier the disk-image driver left in the loop device's file name
 // field, when that field holds one (a UUID in its 8-4-4-4-12 form); none otherwise.
 std::optional<std::string> ReadLoopIdentifier(const std::string& node);
-bool IsUuidText(std::string_view text);
 
 // Makes the block node `path` for `number` when nothing exists at that path. Answers
 // true when it made the node. Failures are logged.

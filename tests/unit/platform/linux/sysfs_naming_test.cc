@@ -1,6 +1,7 @@
 // Names the sysfs provider derives: partition-table content strings and USB location IDs.
 #include <gtest/gtest.h>
 
+#include "platform/linux/format_attach_request.h"
 #include "platform/linux/registry_sysfs.h"
 
 namespace brisvale::registry::sysfs {
@@ -39,10 +40,10 @@ TEST(MediaContent, GuidsUpperCaseMbrTypesInHexSchemesByName) {
   EXPECT_EQ(SchemeContent("gpt"), "GPT_partition_scheme");
   EXPECT_EQ(SchemeContent("dos"), "MBR_partition_scheme");
   EXPECT_EQ(SchemeContent(""), "");
-  EXPECT_TRUE(IsUuidText("0F8E6A42-1B2C-4D3E-8F90-A1B2C3D4E5F6"));
-  EXPECT_FALSE(IsUuidText("/tmp/image.img"));
-  EXPECT_FALSE(IsUuidText("0F8E6A42-1B2C-4D3E-8F90-A1B2C3D4E5F"));
-  EXPECT_FALSE(IsUuidText("0F8E6A42x1B2C-4D3E-8F90-A1B2C3D4E5F6"));
+  EXPECT_TRUE(formats::IsUuidText("0F8E6A42-1B2C-4D3E-8F90-A1B2C3D4E5F6"));
+  EXPECT_FALSE(formats::IsUuidText("/tmp/image.img"));
+  EXPECT_FALSE(formats::IsUuidText("0F8E6A42-1B2C-4D3E-8F90-A1B2C3D4E5F"));
+  EXPECT_FALSE(formats::IsUuidText("0F8E6A42x1B2C-4D3E-8F90-A1B2C3D4E5F6"));
 }
 
 }  // namespace
