@@ -29,4 +29,25 @@ for _ in $(seq 100); do
 done
 [[ -n "$manager" ]] || { echo "check-unit.sh: the service manager did not start" >&2; exit 1; }
 
-nsenter -t "$manager" -a --wd="$PWD" env BRISVALE_UNIT_DIR="$units" BRISVALE_DEMO_BUILT=1 scripts/demo.sh
+out="$units/demo.out"
+nsenter -t "$manager" -a --wd="$PWD" env BRISVALE_UNIT_DIR="$units" BRISVALE_DEMO_BUILT=1 \
+  scripts/demo.sh >"$out" 2>&1
+# The demo goes on past a failed step, so its outcomes are checked here: each line is
+# one piece of work the unit's options could break.
+missing=0
+while IFS= read -r expected; do
+  grep -qF -- "$expected" "$out" || { echo "check-unit.sh: missing: $expected" >&2; missing=1; }
+done <<'EXPECTED'
+debug: Attempting destruction of /private/var/mnt/stale.
+default: Successfully mounted /Developer
+com.vantrel.demo.hello  /Developer/usr/bin/hello
+"MountPath": "/private/var/personalized_debug"
+Sync /Developer: done
+Unmount /Developer: done
+Unmount /private/var/personalized_debug: done
+default: Successfully mounted /var/mnt/mount1.
+[alert 1] answered
+com.vantrel.mobile.camera_attached
+EXPECTED
+if [[ $missing -ne 0 ]]; then cat "$out" >&2; exit 1; fi
+echo "check-unit.sh: the demo did all its work under the service unit"
