@@ -105,10 +105,7 @@ TEST(Daemon, CrowdsAndParkedFramesCannotStopOrExhaustTheService) {
   settled();
   const std::string path = daemon.ServiceSocket();
   const pid_t single = AsUser(kNobody, path, 0, [&] {
-    auto client = ipc::Client::Connect(path);
-    const plist::Bytes request = plist::WriteBinary(plist::Dictionary{{"RequestType", "CopyDevices"}});
-    return client && client->Request({{"EncodedDictionary", plist::Value(request)}}, std::chrono::seconds(10)).ok()
-               ? 0 : 5;
+    return daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}).ok() ? 0 : 5;
   });
   EXPECT_EQ(ExitStatus(single), 0);
   const auto uncrowded = settled();

@@ -67,9 +67,8 @@ bool SetFlag(const fs::path& path, int flag) {
          (flags |= flag, ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags) == 0);
 }
 
-class StaleMountPointsTest : public ::testing::Test {
- protected:
-  StaleMountPointsTest() : services_(Services{&registry_, &os}) {
+struct StaleMountPointsTest : ::testing::Test {
+  StaleMountPointsTest() {
     fs::create_directories(root);
     os.mounts = {{0, "proc", "/proc", "proc"}};  // nothing of the daemon's is mounted
   }
@@ -84,10 +83,8 @@ class StaleMountPointsTest : public ::testing::Test {
   const fs::path base = scratch.path(), root = base / "mnt";
   TreeOs os;
   log::CaptureSink capture;
-
- private:
-  registry::RegistryModel registry_;
-  ScopedServices services_;
+  registry::RegistryModel registry;
+  ScopedServices services{Services{&registry, &os}};
 };
 
 TEST_F(StaleMountPointsTest, EmptiesTheRootButNotWhatLinksPointTo) {

@@ -18,7 +18,6 @@ namespace brisvale {
 namespace {
 
 using ::testing::ElementsAre;
-using ::testing::IsEmpty;
 
 // Records each call; a call answers what `results` holds under its name, 0 by default.
 class RecordingOs : public testing::FakeOs {
@@ -54,14 +53,13 @@ class RecordingNotify : public notify::SystemNotify {
   std::vector<std::string> posted;
 };
 
-class UnmountSyncTest : public ::testing::Test {
- protected:
-  UnmountSyncTest() : services_(Services{&registry_, &os, nullptr, &center}) {
+struct UnmountSyncTest : ::testing::Test {
+  UnmountSyncTest() {
     os.mounts = {{0, "ext4", "/private/var/mnt/media1", "/dev/sdb1"},
                  {os::kMountReadOnly, "ext4", "/Developer", "/dev/loop2"}};
     // Known to the registry but not listed as attached media: only the mounts count.
     for (const char* name : {"sdb1", "loop2"}) {
-      registry_.Publish(nullptr, "KxMedia",
+      registry.Publish(nullptr, "KxMedia",
                         {{"BSD Name", name}, {"Content", ""}, {"Removable", plist::Value::Bool(false)},
                          {"Leaf", plist::Value::Bool(true)}});
     }
@@ -76,32 +74,13 @@ class UnmountSyncTest : public ::testing::Test {
   RecordingOs os;
   RecordingNotify center;
   log::CaptureSink capture;
-
- private:
-  registry::RegistryModel registry_;
-  ScopedServices services_;
+  registry::RegistryModel registry;
+  ScopedServices services{Services{&registry, &os, nullptr, &center}};
 };
 
-TEST_F(UnmountSyncTest, UnmountRemovesTheMountPointEjectsAndAnnouncesAndSyncFlushes) {
-  EXPECT_EQ(Run(HandleUnmount, {{"MountPath", "/private/var/mnt/media1"}}), "Success");
-  EXPECT_THAT(os.calls, ElementsAre("force-unmount /private/var/mnt/media1", "rmdir /private/var/mnt/media1",
-                                    "open /dev/sdb1", "eject"));
-  EXPECT_THAT(center.posted, ElementsAre("com.vantrel.brisvale_unmounted"));
-
-  // The developer directory is part of the system image and stays.
-  os.calls.clear();
-  EXPECT_EQ(Run(HandleUnmount, {{"MountPath", "/Developer"}}), "Success");
-  EXPECT_THAT(os.calls, ElementsAre("force-unmount /Developer", "open /dev/loop2", "eject"));
-
-  os.calls.clear();
-  EXPECT_EQ(Run(HandleSync, {{"MountPath", "/Developer"}}), "Success");
-  EXPECT_THAT(os.calls, ElementsAre("sync /Developer"));
-  EXPECT_THAT(capture.Texts(log::Level::Default), IsEmpty());
-}
-
 // Every call the handlers make fails in turn: each failure's line, and how many calls
-// ran, which pins their order too.
-TEST_F(UnmountSyncTest, EachFailureLogsItsLineAndLeavesTheRest) {
+// ran, which pins their order too; then each request succeeds.
+TEST_F(UnmountSyncTest, EachStepFailsWithItsLineAndLeavesTheRest) {
   struct Case {
     const char* name;
     void (*handler)(const plist::Value&, plist::Dictionary&);
@@ -135,6 +114,10 @@ TEST_F(UnmountSyncTest, EachFailureLogsItsLineAndLeavesTheRest) {
        {"There is no matching entry for /private/var/mnt/nothing."}, 0, 0},
       {"sync fails", HandleSync, media1, "sync", -EIO, "Failure",
        {"Failed to force the sync /private/var/mnt/media1: 5"}, 1, 0},
+      {"sync", HandleSync, {{"MountPath", "/Developer"}}, "", 0, "Success", {}, 1, 0},
+      // The developer directory is part of the system image and stays.
+      {"unmount the developer directory", HandleUnmount, {{"MountPath", "/Developer"}}, "", 0, "Success", {}, 3, 1},
+      {"unmount", HandleUnmount, media1, "", 0, "Success", {}, 4, 1},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
@@ -147,6 +130,10 @@ TEST_F(UnmountSyncTest, EachFailureLogsItsLineAndLeavesTheRest) {
     EXPECT_EQ(os.calls.size(), c.calls);
     EXPECT_EQ(center.posted.size(), c.posted);
   }
+  // The last row ran every step, on the mount point and the device the mount table names.
+  EXPECT_THAT(os.calls, ElementsAre("force-unmount /private/var/mnt/media1", "rmdir /private/var/mnt/media1",
+                                    "open /dev/sdb1", "eject"));
+  EXPECT_THAT(center.posted, ElementsAre("com.vantrel.brisvale_unmounted"));
 }
 
 }  // namespace
