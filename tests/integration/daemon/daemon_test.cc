@@ -60,12 +60,6 @@ pid_t AsUser(uid_t uid, const std::string& path, int count, const std::function<
   _exit(then());
 }
 
-int ExitStatus(pid_t pid) {
-  int status = 0;
-  waitpid(pid, &status, 0);
-  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-}
-
 // 1,000 idle connections of one unprivileged user under a limit of 1,024 descriptors,
 // then 64 connections that each send half of a 4 MB frame and stop. The crowd's surplus
 // is refused with a line and the frames past the budget of all connections are
@@ -95,7 +89,9 @@ TEST(Daemon, CrowdsAndParkedFramesCannotStopOrExhaustTheService) {
   EXPECT_TRUE(daemon.LogContains(
       "default: Refusing a vexa connection of uid 65534: 64 open of 64 for one user, 64 of 256 in all"));
   close(sync[0]);
-  EXPECT_EQ(ExitStatus(crowd), 0);
+  int status = -1;
+  waitpid(crowd, &status, 0);
+  EXPECT_EQ(status, 0) << "the crowd could not make its connections";
   // One more than before: the mount table the first listing opened stays open. The
   // daemon lets go of a connection a moment after its peer has gone.
   const auto settled = [&] {
@@ -107,23 +103,20 @@ TEST(Daemon, CrowdsAndParkedFramesCannotStopOrExhaustTheService) {
   const pid_t single = AsUser(kNobody, path, 0, [&] {
     return daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}).ok() ? 0 : 5;
   });
-  EXPECT_EQ(ExitStatus(single), 0);
+  waitpid(single, &status, 0);
+  EXPECT_EQ(status, 0) << "the user was not served once its crowd had gone";
   const auto uncrowded = settled();
   EXPECT_LE(uncrowded.first, before.first + 1);
 
   std::vector<UniqueFd> parked;
-  const std::vector<uint8_t> half(2'000'000, 'x');
+  std::vector<uint8_t> halfFrame(4 + 2'000'000, 'x');
+  const uint8_t header[4] = {0x00, 0x3D, 0x09, 0x00};  // 4,000,000 bytes follow
+  std::copy_n(header, 4, halfFrame.begin());
   for (int i = 0; i < 64; ++i) {
     UniqueFd fd = ipc::ConnectToPath(path, nullptr);
     ASSERT_TRUE(fd);
-    fcntl(fd.get(), F_SETFL, 0);  // blocking: each sends its half frame in full
-    const uint8_t header[4] = {0x00, 0x3D, 0x09, 0x00};  // 4,000,000 bytes follow
-    bool open = send(fd.get(), header, sizeof header, MSG_NOSIGNAL) == 4;
-    for (size_t sent = 0; open && sent < half.size();) {
-      const ssize_t n = send(fd.get(), half.data() + sent, half.size() - sent, MSG_NOSIGNAL);
-      open = n > 0;
-      sent += n > 0 ? static_cast<size_t>(n) : 0;
-    }
+    fcntl(fd.get(), F_SETFL, 0);  // blocking: the send returns once all is taken in or the daemon hangs up
+    send(fd.get(), halfFrame.data(), halfFrame.size(), MSG_NOSIGNAL);
     parked.push_back(std::move(fd));
   }
   EXPECT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}).ok());

@@ -155,9 +155,9 @@ TEST_F(TransportTest, EchoesWithThePeerIdentityAndTellsFailuresApart) {
   Start();
   std::optional<Client> client = Client::Connect(SocketPath());
   ASSERT_TRUE(client);
-  ClientReply reply = client->Request({{"Tag", "a"}, {"Payload", plist::Value(Bytes{1, 2, 3})}}, 3s);
+  ClientReply reply = client->Request({{"Tag", "a"}}, 3s);
   ASSERT_TRUE(reply.ok()) << reply.error;
-  EXPECT_EQ(reply.body.find("Payload")->data()->size(), 3u);
+  EXPECT_EQ(Text(reply.body, "Tag"), "a");
   EXPECT_FALSE(reply.body.find("vexa.reply-to")) << "transport keys stay in the transport";
   EXPECT_EQ(reply.body.find("PeerPid")->integer()->value, getpid());
   EXPECT_EQ(Text(reply.body, "PeerPath"), std::filesystem::read_symlink("/proc/self/exe").string());
@@ -167,28 +167,27 @@ TEST_F(TransportTest, EchoesWithThePeerIdentityAndTellsFailuresApart) {
   EXPECT_EQ(client->Request({{"Command", "Drop"}}, 3s).status, ClientStatus::Cancelled);
 }
 
-// Three requests in one burst, trickled over about twice the partial-frame timeout and
-// never silent for long: all are answered in order although the first is slow.
+// Two requests in one burst, trickled over about twice the partial-frame timeout and
+// never silent for long: both are answered in order although the first is slow. (A
+// reply to a request without an id carries none: the message unit test's.)
 TEST_F(TransportTest, TrickledBurstIsAnsweredInOrder) {
   Start();
   Bytes burst = FrameOf({{"vexa.id", plist::Value::Int(10)}, {"Tag", "1"}, {"Command", "Slow"}});
-  for (const Bytes& frame : {FrameOf({{"Tag", "2"}}), FrameOf({{"vexa.id", plist::Value::Int(30)}, {"Tag", "3"}})}) {
-    burst.insert(burst.end(), frame.begin(), frame.end());
-  }
+  const Bytes second = FrameOf({{"vexa.id", plist::Value::Int(30)}, {"Tag", "2"}});
+  burst.insert(burst.end(), second.begin(), second.end());
   RawPeer peer(SocketPath());
   const size_t step = burst.size() / 6 + 1;
   for (size_t pos = 0; pos < burst.size(); pos += step) {
     peer.Write(Bytes(burst.begin() + pos, burst.begin() + std::min(burst.size(), pos + step)));
     std::this_thread::sleep_for(100ms);
   }
-  auto replies = peer.Read(3);
+  auto replies = peer.Read(2);
   ASSERT_TRUE(replies);
-  ASSERT_EQ(replies->size(), 3u);
+  ASSERT_EQ(replies->size(), 2u);
   EXPECT_EQ(Text((*replies)[0], "Tag"), "1");
   EXPECT_EQ((*replies)[0].find("vexa.reply-to")->integer()->value, 10);
   EXPECT_EQ(Text((*replies)[1], "Tag"), "2");
-  EXPECT_FALSE((*replies)[1].find("vexa.reply-to")) << "a request without an id gets a reply without one";
-  EXPECT_EQ((*replies)[2].find("vexa.reply-to")->integer()->value, 30);
+  EXPECT_EQ((*replies)[1].find("vexa.reply-to")->integer()->value, 30);
 }
 
 // One case per way a connection fails: the frame reader refuses (the ways it does are
@@ -297,8 +296,7 @@ TEST_F(TransportTest, EventsFromRootPostersReachTheirStreamOnly) {
   });
 
   const std::string events = EventsSocketPath(options_);
-  ClientReply posted = PostEvent(events, "com.example.wanted", "first");
-  EXPECT_TRUE(posted.ok()) << posted.error;
+  EXPECT_TRUE(PostEvent(events, "com.example.wanted", "first").ok());
   EXPECT_TRUE(PostEvent(events, "com.example.other", "elsewhere").ok());
 
   const pid_t child = fork();

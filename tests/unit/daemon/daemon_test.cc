@@ -18,7 +18,6 @@
 namespace brisvale {
 namespace {
 
-using ::testing::Contains;
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
 
@@ -93,7 +92,6 @@ TEST(HandleRequest, RejectsOrServesEachRequestWithItsLines) {
        {"Failed to create dictionary with data."}},
       {"top level is an array", Request(plist::Array{"CopyDevices"}, /*xml=*/true),
        {"Invalid value for RequestType: (null)"}},
-      {"request type not text", Request(OfType(plist::Value::Int(3))), {"Invalid value for RequestType: 3"}},
       {"operation name is not a request type", Request(OfType("MountDevice")), {"Invalid request type: MountDevice"}},
       // Only a listing succeeds without further keys; the others say which handler ran.
       {"listing", Request(OfType("CopyDevices")), {}, "Success"},
@@ -235,7 +233,7 @@ TEST_F(DaemonTest, HardwareEventsAreRoutedByExactName) {
     log::CaptureSink capture;
     ipc.streamHandler(ipc::StreamEvent{name});
     const std::vector<std::string> lines = capture.Texts();
-    EXPECT_THAT(lines, Contains("Kestrix Event: " + name));
+    EXPECT_EQ(std::ranges::count(lines, "Kestrix Event: " + name), 1) << name;
     EXPECT_EQ(std::ranges::count(lines, "Unsupported Kestrix Event: " + name), supported ? 0 : 1) << name;
   }
   log::CaptureSink capture;

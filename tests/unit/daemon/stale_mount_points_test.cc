@@ -50,16 +50,6 @@ class TreeOs : public testing::FakeOs {
   int closeError = 0;  // what closing a directory that was read answers
 };
 
-// Makes `depth` nested directories named "d" below `top`, without any path limit.
-void MakeDeepTree(const fs::path& top, int depth) {
-  UniqueFd dir(::open(top.c_str(), O_RDONLY | O_DIRECTORY));
-  for (int i = 0; i < depth && dir; ++i) {
-    ::mkdirat(dir.get(), "d", 0755);
-    dir = UniqueFd(::openat(dir.get(), "d", O_RDONLY | O_DIRECTORY));
-  }
-  ASSERT_TRUE(dir);
-}
-
 bool SetFlag(const fs::path& path, int flag) {
   const UniqueFd fd(::open(path.c_str(), O_RDONLY));
   int flags = 0;
@@ -94,7 +84,6 @@ TEST_F(StaleMountPointsTest, EmptiesTheRootButNotWhatLinksPointTo) {
   std::ofstream(base / "outside") << "precious";
   fs::create_directory_symlink(base, root / "link-out");
   fs::create_symlink(base / "outside", root / "stale/link-to-file");
-  fs::create_symlink(root / "missing", root / "dangling");
   ASSERT_EQ(::mkfifo((root / "stale/fifo").c_str(), 0600), 0);
   // A name that is no text cannot be looked up, so it counts as not mounted.
   fs::create_directories(root / "stale-\xff/inner");
@@ -147,7 +136,14 @@ TEST_F(StaleMountPointsTest, NothingOutsideTheRootIsTouched) {
   fs::create_directories(root / "swaps/victim/inner");
   std::ofstream(root / "swaps/victim/inner/file") << "x";
   fs::create_directories(root / "deep");
-  MakeDeepTree(root / "deep", 10000);
+  // 10,000 nested directories, made relative to each other: no path could name them.
+  UniqueFd deep(::open((root / "deep").c_str(), O_RDONLY | O_DIRECTORY));
+  for (int i = 0; i < 10000 && deep; ++i) {
+    ::mkdirat(deep.get(), "d", 0755);
+    deep = UniqueFd(::openat(deep.get(), "d", O_RDONLY | O_DIRECTORY));
+  }
+  ASSERT_TRUE(deep);
+  deep.Reset();
   const std::string victim = (root / "swaps/victim").string();
   os::SetTreeWalkHookForTesting([&](const std::string& path) {
     if (path != victim) return;
