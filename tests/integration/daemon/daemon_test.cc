@@ -99,8 +99,7 @@ TEST(Daemon, CrowdsAndParkedFramesCannotStopOrExhaustTheService) {
     return Holdings(daemon.pid());
   };
   settled();
-  const std::string path = daemon.ServiceSocket();
-  const pid_t single = AsUser(kNobody, path, 0, [&] {
+  const pid_t single = AsUser(kNobody, daemon.ServiceSocket(), 0, [&] {
     return daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}).ok() ? 0 : 5;
   });
   waitpid(single, &status, 0);
@@ -113,7 +112,7 @@ TEST(Daemon, CrowdsAndParkedFramesCannotStopOrExhaustTheService) {
   const uint8_t header[4] = {0x00, 0x3D, 0x09, 0x00};  // 4,000,000 bytes follow
   std::copy_n(header, 4, halfFrame.begin());
   for (int i = 0; i < 64; ++i) {
-    UniqueFd fd = ipc::ConnectToPath(path, nullptr);
+    UniqueFd fd = ipc::ConnectToPath(daemon.ServiceSocket(), nullptr);
     ASSERT_TRUE(fd);
     fcntl(fd.get(), F_SETFL, 0);  // blocking: the send returns once all is taken in or the daemon hangs up
     send(fd.get(), halfFrame.data(), halfFrame.size(), MSG_NOSIGNAL);
@@ -134,9 +133,6 @@ TEST(Daemon, CrowdsAndParkedFramesCannotStopOrExhaustTheService) {
   EXPECT_TRUE(std::ranges::any_of(daemon.LogLines(), [](const std::string& line) {
     return line.find("over the budget") != std::string::npos;
   }));
-  std::printf("descriptors %zu/%zu/%zu/%zu, RssAnon KiB %ld/%ld/%ld/%ld (before/crowd gone/parked/after)\n",
-              before.first, uncrowded.first, during.first, after.first, before.second, uncrowded.second,
-              during.second, after.second);
 }
 
 }  // namespace

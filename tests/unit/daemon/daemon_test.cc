@@ -178,12 +178,7 @@ class FakeIpc : public ipc::IpcService {
 struct DaemonTest : ::testing::Test {
   RunLoop loop;
   FakeIpc ipc;
-  // The other services stay those the test binary installed.
-  ScopedServices services{[this] {
-    Services withFakeIpc = CurrentServices();
-    withFakeIpc.ipc = &ipc;
-    return withFakeIpc;
-  }()};
+  ScopedServices services{Services{&emptyRegistry, &quietOs, &ipc}};
   MatchingContext context;
   std::vector<int> exits;
   Daemon daemon{loop, context, [this](int status) { exits.push_back(status); }};

@@ -153,16 +153,14 @@ TEST_F(StaleMountPointsTest, NothingOutsideTheRootIsTouched) {
 
   RemoveStaleMountPoints(root.c_str());
   os::SetTreeWalkHookForTesting(nullptr);
-  const bool bindHeld = ::umount2((root / "binds/bind").c_str(), MNT_DETACH) == 0;
-  EXPECT_TRUE(bindHeld) << "the bind mount was removed";
+  EXPECT_EQ(::umount2((root / "binds/bind").c_str(), MNT_DETACH), 0) << "the bind mount was removed";
 
   EXPECT_TRUE(fs::exists(outside / "precious"));
   EXPECT_TRUE(fs::exists(outside / "sub/precious"));
   EXPECT_TRUE(fs::exists(base / "moved-victim/inner/file"));
   EXPECT_FALSE(fs::exists(root / "swaps"));
   EXPECT_FALSE(fs::exists(root / "deep"));
-  const std::string bind = (root / "binds/bind").string();
-  EXPECT_THAT(capture.Texts(), ::testing::IsSupersetOf({"Failed to remove " + bind + ": 16",
+  EXPECT_THAT(capture.Texts(), ::testing::IsSupersetOf({"Failed to remove " + (root / "binds/bind").string() + ": 16",
                                                         "Failed to delete " + (root / "binds").string() + "."}));
 
   fs::create_directory_symlink(outside, root / "start-link");
