@@ -15,7 +15,6 @@
 #include <functional>
 
 #include "base/unique_fd.h"
-#include "platform/linux/ipc_client.h"
 #include "platform/linux/ipc_socket.h"
 #include "sandbox_daemon.h"
 
