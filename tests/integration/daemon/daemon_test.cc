@@ -1,100 +1,25 @@
-// The daemon in a sandbox root, driven over its real socket.
+// The daemon in a sandbox root under crowds of connections over its real socket: what
+// it holds stays within its limits, others are served meanwhile, and it all goes back.
 #include <fcntl.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
-#include <sys/un.h>
-#include <sys/xattr.h>
 #include <unistd.h>
 
-#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <csignal>
-#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <functional>
 
 #include "base/unique_fd.h"
-#include "platform/linux/ipc_client.h"
-#include "platform/linux/ipc_frame.h"
+#include "platform/linux/ipc_socket.h"
 #include "sandbox_daemon.h"
 
 namespace brisvale::testing {
 namespace {
-
-struct DaemonTest : ::testing::Test {
-  void SetUp() override {
-    BRISVALE_REQUIRE_ROOT();
-    ASSERT_TRUE(daemon.Start()) << "daemon did not start in " << daemon.root();
-  }
-  SandboxDaemon daemon;
-};
-
-// A blocking connection to the Unix socket at `path`; -1 when it cannot be made.
-int ConnectTo(const std::string& path) {
-  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
-  if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0) return fd;
-  close(fd);
-  return -1;
-}
-
-// A process that connects without the entitlement and then execs a program that has it
-// is served without: the daemon goes by the program that connected.
-TEST_F(DaemonTest, ExecAfterConnectIsServedWithoutEntitlements) {
-  const ScratchDir copies;
-  const std::string client = (copies / "entitled-ctl").string();
-  std::filesystem::copy_file(BRISVALE_CTL_PATH, client);
-  const std::string entitlements = plist::WriteXml(
-      plist::Dictionary{{"com.vantrel.private.brisvale.allowedSPI", plist::Array{"SyncDevice"}}});
-  if (setxattr(client.c_str(), "trusted.vexa.entitlements", entitlements.data(), entitlements.size(), 0) != 0) {
-    GTEST_SKIP() << "trusted extended attributes unsupported here";
-  }
-  constexpr int kChildConnection = 100;  // where the child keeps it, for the test to copy
-  int go[2];  // the exec waits until the daemon has taken the connection in
-  ASSERT_EQ(pipe2(go, O_CLOEXEC), 0);
-  const pid_t child = fork();
-  if (child == 0) {
-    char byte = 0;
-    close(go[1]);  // so that the read ends should the test end first
-    if (dup2(ConnectTo(daemon.ServiceSocket()), kChildConnection) < 0 || read(go[0], &byte, 1) != 1) _exit(3);
-    execl(client.c_str(), client.c_str(), "--root", daemon.root().c_str(), "watch", static_cast<char*>(nullptr));
-    _exit(4);
-  }
-  struct Reap {
-    pid_t pid;
-    ~Reap() { kill(pid, SIGKILL), waitpid(pid, nullptr, 0); }
-  } reap{child};
-  const std::string self = std::filesystem::read_symlink("/proc/self/exe").filename().string();
-  EXPECT_TRUE(daemon.WaitForLogLine("debug: new vexa connection: " + self + "<" + std::to_string(child) + ">",
-                                    std::chrono::seconds(20)));
-  const UniqueFd pidfd(static_cast<int>(syscall(SYS_pidfd_open, child, 0)));
-  UniqueFd connection;  // the child may still be moving it into place
-  for (int i = 0; i < 500 && !connection; ++i, usleep(10000)) {
-    connection.Reset(static_cast<int>(syscall(SYS_pidfd_getfd, pidfd.get(), kChildConnection, 0)));
-  }
-  ASSERT_TRUE(connection) << strerror(errno);
-  ASSERT_EQ(write(go[1], "", 1), 1);
-  const std::string exe = "/proc/" + std::to_string(child) + "/exe";
-  for (int i = 0; i < 200 && std::filesystem::read_symlink(exe).string() != client; ++i) usleep(10000);
-
-  const auto frame = ipc::EncodeFrame(plist::Dictionary{
-      {"EncodedDictionary", plist::Value(plist::WriteBinary(plist::Dictionary{{"RequestType", "Sync"}}))}});
-  ASSERT_TRUE(frame);
-  EXPECT_EQ(send(connection.get(), frame->data(), frame->size(), MSG_NOSIGNAL), static_cast<ssize_t>(frame->size()));
-  EXPECT_TRUE(daemon.WaitForLogLine("default: Serving pid " + std::to_string(child) +
-                                    " without entitlements: it no longer runs the program that connected"));
-  EXPECT_TRUE(daemon.WaitForLogLine(
-      "default: Missing required entitlement (will be required in <kelpie://problem/25909614>): SyncDevice"));
-  for (const int fd : go) close(fd);
-}
 
 #ifndef __has_feature
 #define __has_feature(x) 0
@@ -129,21 +54,20 @@ pid_t AsUser(uid_t uid, const std::string& path, int count, const std::function<
   setrlimit(RLIMIT_NOFILE, &files);
   if (setgid(uid) != 0 || setuid(uid) != 0) _exit(2);
   for (int i = 0; i < count; ++i) {
-    if (ConnectTo(path) < 0) _exit(3);
+    if (ipc::ConnectToPath(path, nullptr).release() < 0) _exit(3);  // held until the exit
   }
   _exit(then());
 }
 
-int ExitStatus(pid_t pid) {
-  int status = 0;
-  waitpid(pid, &status, 0);
-  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-}
-
-// 1,000 idle connections of one unprivileged user under a limit of 1,024 descriptors:
-// the surplus is refused with a line, root is served meanwhile, and once they are gone
-// the user is served again.
-TEST_F(DaemonTest, IdleCrowdCannotStopTheService) {
+// 1,000 idle connections of one unprivileged user under a limit of 1,024 descriptors,
+// then 64 connections that each send half of a 4 MB frame and stop. The crowd's surplus
+// is refused with a line and the frames past the budget of all connections are
+// cancelled; root is served throughout, the user again once its crowd is gone, and the
+// daemon stays small and gives back what it held.
+TEST(Daemon, CrowdsAndParkedFramesCannotStopOrExhaustTheService) {
+  BRISVALE_REQUIRE_ROOT();
+  SandboxDaemon daemon;
+  ASSERT_TRUE(daemon.Start()) << "daemon did not start in " << daemon.root();
   constexpr uid_t kNobody = 65534;
   ASSERT_EQ(chmod(daemon.root().c_str(), 0755), 0);
   const rlimit limit{1024, 1024};
@@ -161,11 +85,12 @@ TEST_F(DaemonTest, IdleCrowdCannotStopTheService) {
   ASSERT_EQ(read(sync[0], &byte, 1), 1);
   // Root's connection queues behind the crowd's and is served once they are taken in.
   EXPECT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}).ok());
-  const auto during = Holdings(daemon.pid());
   EXPECT_TRUE(daemon.LogContains(
       "default: Refusing a vexa connection of uid 65534: 64 open of 64 for one user, 64 of 256 in all"));
   close(sync[0]);
-  EXPECT_EQ(ExitStatus(crowd), 0);
+  int status = -1;
+  waitpid(crowd, &status, 0);
+  EXPECT_EQ(status, 0) << "the crowd could not make its connections";
   // One more than before: the mount table the first listing opened stays open. The
   // daemon lets go of a connection a moment after its peer has gone.
   const auto settled = [&] {
@@ -173,38 +98,23 @@ TEST_F(DaemonTest, IdleCrowdCannotStopTheService) {
     return Holdings(daemon.pid());
   };
   settled();
-
-  const std::string path = daemon.ServiceSocket();
-  const pid_t single = AsUser(kNobody, path, 0, [&] {
-    auto client = ipc::Client::Connect(path);
-    const plist::Bytes request = plist::WriteBinary(plist::Dictionary{{"RequestType", "CopyDevices"}});
-    return client && client->Request({{"EncodedDictionary", plist::Value(request)}}, std::chrono::seconds(10)).ok()
-               ? 0 : 5;
+  const pid_t single = AsUser(kNobody, daemon.ServiceSocket(), 0, [&] {
+    return daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}).ok() ? 0 : 5;
   });
-  EXPECT_EQ(ExitStatus(single), 0);
-  const auto after = settled();
-  EXPECT_LE(during.first, 1024u);
-  EXPECT_LE(after.first, before.first + 1);
-  std::printf("descriptors %zu/%zu/%zu, RssAnon KiB %ld/%ld/%ld (before/during/after)\n", before.first,
-              during.first, after.first, before.second, during.second, after.second);
-}
+  waitpid(single, &status, 0);
+  EXPECT_EQ(status, 0) << "the user was not served once its crowd had gone";
+  const auto uncrowded = settled();
+  EXPECT_LE(uncrowded.first, before.first + 1);
 
-// 64 connections that each send half of a 4 MB frame and stop: past the budget of all
-// connections they are cancelled, the daemon stays small, and gives the memory back.
-TEST_F(DaemonTest, ParkedHalfFramesStayWithinTheBudget) {
-  const auto before = Holdings(daemon.pid());
   std::vector<UniqueFd> parked;
-  const std::vector<uint8_t> half(2'000'000, 'x');
+  std::vector<uint8_t> halfFrame(4 + 2'000'000, 'x');
+  const uint8_t header[4] = {0x00, 0x3D, 0x09, 0x00};  // 4,000,000 bytes follow
+  std::copy_n(header, 4, halfFrame.begin());
   for (int i = 0; i < 64; ++i) {
-    UniqueFd fd(ConnectTo(daemon.ServiceSocket()));
+    UniqueFd fd = ipc::ConnectToPath(daemon.ServiceSocket(), nullptr);
     ASSERT_TRUE(fd);
-    const uint8_t header[4] = {0x00, 0x3D, 0x09, 0x00};  // 4,000,000 bytes follow
-    bool open = send(fd.get(), header, sizeof header, MSG_NOSIGNAL) == 4;
-    for (size_t sent = 0; open && sent < half.size();) {
-      const ssize_t n = send(fd.get(), half.data() + sent, half.size() - sent, MSG_NOSIGNAL);
-      open = n > 0;
-      sent += n > 0 ? static_cast<size_t>(n) : 0;
-    }
+    fcntl(fd.get(), F_SETFL, 0);  // blocking: the send returns once all is taken in or the daemon hangs up
+    send(fd.get(), halfFrame.data(), halfFrame.size(), MSG_NOSIGNAL);
     parked.push_back(std::move(fd));
   }
   EXPECT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}).ok());
@@ -216,14 +126,12 @@ TEST_F(DaemonTest, ParkedHalfFramesStayWithinTheBudget) {
   // AddressSanitizer keeps freed memory in quarantine, so the daemon's own footprint
   // only shows in an uninstrumented build.
   if (!kSanitized) {
-    EXPECT_LT(during.second, before.second + 40 * 1024);  // the 32 MiB budget and what is being read
-    EXPECT_LE(after.second, before.second + 1024);
+    EXPECT_LT(during.second, uncrowded.second + 40 * 1024);  // the 32 MiB budget and what is being read
+    EXPECT_LE(after.second, uncrowded.second + 1024);
   }
   EXPECT_TRUE(std::ranges::any_of(daemon.LogLines(), [](const std::string& line) {
     return line.find("over the budget") != std::string::npos;
   }));
-  std::printf("descriptors %zu/%zu/%zu, RssAnon KiB %ld/%ld/%ld (before/during/after)\n", before.first,
-              during.first, after.first, before.second, during.second, after.second);
 }
 
 }  // namespace

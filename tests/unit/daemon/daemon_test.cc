@@ -18,7 +18,6 @@
 namespace brisvale {
 namespace {
 
-using ::testing::Contains;
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
 
@@ -26,7 +25,6 @@ using ::testing::IsEmpty;
 class FakeConnection : public ipc::Connection {
  public:
   std::string executablePath = "/usr/libexec/imgclient";
-  pid_t pid = 412;
   std::optional<plist::Value> allowedSPI;
   std::vector<ipc::Message> sent;
   bool cancelled = false;
@@ -38,7 +36,7 @@ class FakeConnection : public ipc::Connection {
     return true;
   }
   void Cancel() override { cancelled = true; }
-  pid_t PeerPid() const override { return pid; }
+  pid_t PeerPid() const override { return 412; }
   uid_t PeerUid() const override { return 0; }
   std::string PeerExecutablePath() const override { return executablePath; }
   std::optional<plist::Value> CopyEntitlement(std::string_view name) const override {
@@ -48,7 +46,7 @@ class FakeConnection : public ipc::Connection {
 };
 
 // Requests reach the real handlers: an empty registry and a mount table with nothing of
-// the daemon's in it.
+// the daemon's in it (an empty one cannot be read).
 registry::RegistryModel emptyRegistry;
 testing::FakeOs quietOs = [] {
   testing::FakeOs os;
@@ -56,9 +54,6 @@ testing::FakeOs quietOs = [] {
   return os;
 }();
 const ScopedServices services(Services{&emptyRegistry, &quietOs});
-
-constexpr const char* kMissingEntitlement =
-    "Missing required entitlement (will be required in <kelpie://problem/25909614>): ";
 
 ipc::Message RequestCarrying(plist::Value encoded, std::optional<int64_t> id = 7) {
   ipc::Message message;
@@ -74,125 +69,78 @@ ipc::Message Request(const plist::Value& dictionary, bool xml = false, std::opti
                              : plist::Value(plist::WriteBinary(dictionary)), id);
 }
 
+plist::Dictionary OfType(plist::Value type) { return {{"RequestType", std::move(type)}}; }
+
 plist::Value AllSPIs() {
   return plist::Array{"CopyDevices", "MountDevice", "UnmountDevice", "SyncDevice"};
 }
 
-struct Rejection {
-  const char* name;
-  ipc::Message message;
-  const char* line;
-};
-
-TEST(HandleRequest, MalformedRequestsAreRejectedWithTheirLine) {
-  const Rejection cases[] = {
-      {"no encoded dictionary", ipc::Message{}, "Invalid or missing value for EncodedDictionary."},
-      {"encoded dictionary is text", RequestCarrying("RequestType"),
-       "Invalid or missing value for EncodedDictionary."},
-      {"undecodable bytes", RequestCarrying(plist::Bytes{'b', 'p', 'l', 'i', 's', 't', '0', '0', 1}),
-       "Failed to create dictionary with data."},
-      {"top level is an array", Request(plist::Array{"CopyDevices"}, /*xml=*/true),
-       "Invalid value for RequestType: (null)"},
-      {"no request type", Request(plist::Dictionary{{"Other", "x"}}),
-       "Invalid value for RequestType: (null)"},
-      {"request type not text", Request(plist::Dictionary{{"RequestType", plist::Value::Int(3)}}),
-       "Invalid value for RequestType: 3"},
-      {"operation name is not a request type",
-       Request(plist::Dictionary{{"RequestType", "MountDevice"}}),
-       "Invalid request type: MountDevice"},
-      {"case matters", Request(plist::Dictionary{{"RequestType", "copydevices"}}),
-       "Invalid request type: copydevices"},
-  };
-  for (const Rejection& c : cases) {
-    SCOPED_TRACE(c.name);
-    log::CaptureSink capture;
-    FakeConnection connection;
-    connection.allowedSPI = AllSPIs();
-    MatchingContext context;
-    EXPECT_FALSE(HandleRequest(context, &connection, c.message));
-    EXPECT_THAT(connection.sent, IsEmpty());
-    EXPECT_THAT(capture.Texts(Level::Default), ElementsAre(c.line));
-  }
-}
-
-TEST(HandleRequest, EveryRequestTypeGetsABinaryReplyRoutedToTheCaller) {
+// Each check a request can fail, each request type, and each way an entitlement can
+// fall short: what is logged, and the binary reply routed to the caller, or none.
+TEST(HandleRequest, RejectsOrServesEachRequestWithItsLines) {
+  const std::string missing = "Missing required entitlement (will be required in <kelpie://problem/25909614>): ";
   const struct {
-    const char* type;
-    bool xml;
-    std::optional<int64_t> id;  // none: the reply carries none either
-  } cases[] = {{"CopyDevices", false, 7}, {"Mount", false, 7}, {"Unmount", false, std::nullopt}, {"Sync", true, 7}};
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.type);
-    log::CaptureSink capture;
-    FakeConnection connection;
-    connection.allowedSPI = AllSPIs();
-    MatchingContext context;
-    ASSERT_TRUE(HandleRequest(context, &connection, Request(plist::Dictionary{{"RequestType", c.type}}, c.xml, c.id)));
-    ASSERT_EQ(connection.sent.size(), 1u);
-    const ipc::Message& reply = connection.sent[0];
-    EXPECT_TRUE(reply.isReply);
-    EXPECT_EQ(reply.replyToken, c.id ? std::optional(plist::Integer{*c.id, false}) : std::nullopt);
-    const plist::Bytes* bytes = reply.body.find("EncodedDictionary")->data();
-    ASSERT_NE(bytes, nullptr);
-    ASSERT_GE(bytes->size(), 8u);
-    EXPECT_EQ(std::string(bytes->begin(), bytes->begin() + 8), "bplist00");
-    // Only a listing succeeds without further keys.
-    const std::optional<plist::Value> decoded = plist::ReadBinary(*bytes);
-    ASSERT_TRUE(decoded.has_value());
-    EXPECT_EQ(*decoded->get("Status"), plist::Value(c.type == std::string("CopyDevices") ? "Success" : "Failure"));
-  }
-}
-
-TEST(HandleRequest, MissingEntitlementIsLoggedAndRequestStillServed) {
-  struct Case {
     const char* name;
-    std::optional<plist::Value> allowed;
+    ipc::Message message;
     std::vector<std::string> lines;
+    const char* status = nullptr;  // none: refused without a reply
+    std::optional<plist::Value> allowed = AllSPIs();
+  } cases[] = {
+      // (A message with no encoded dictionary at all is the serving test's.)
+      {"dictionary is text", RequestCarrying("RequestType"), {"Invalid or missing value for EncodedDictionary."}},
+      {"undecodable bytes", RequestCarrying(plist::Bytes{'b', 'p', 'l', 'i', 's', 't', '0', '0', 1}),
+       {"Failed to create dictionary with data."}},
+      {"top level is an array", Request(plist::Array{"CopyDevices"}, /*xml=*/true),
+       {"Invalid value for RequestType: (null)"}},
+      {"operation name is not a request type", Request(OfType("MountDevice")), {"Invalid request type: MountDevice"}},
+      // Only a listing succeeds without further keys; the others say which handler ran.
+      {"listing", Request(OfType("CopyDevices")), {}, "Success"},
+      {"mount", Request(OfType("Mount")), {"Invalid value for DeviceType: (null)"}, "Failure"},
+      {"unmount without a reply id", Request(OfType("Unmount"), false, std::nullopt),
+       {"Invalid value for MountPath: (null)"}, "Failure"},
+      {"sync in XML", Request(OfType("Sync"), /*xml=*/true), {"Failed to extract MountPath from request"}, "Failure"},
+      // An absent entitlement fails the same check as one that is no list.
+      {"other operation listed", Request(OfType("CopyDevices")),
+       {"Invalid or missing entitlement: CopyDevices", missing + "CopyDevices"}, "Success",
+       plist::Array{"MountDevice"}},
+      {"single string instead of a list", Request(OfType("CopyDevices")),
+       {"Invalid or missing entitlement: com.vantrel.private.brisvale.allowedSPI", missing + "CopyDevices"}, "Success",
+       plist::Value("CopyDevices")},
+      {"non-string elements skipped", Request(OfType("CopyDevices")), {}, "Success",
+       plist::Array{plist::Value::Int(1), "CopyDevices"}},
   };
-  const std::string listed = std::string(kMissingEntitlement) + "CopyDevices";
-  const Case cases[] = {
-      {"other operation listed", plist::Value(plist::Array{"MountDevice"}),
-       {"Invalid or missing entitlement: CopyDevices", listed}},
-      {"single string instead of array", plist::Value("CopyDevices"),
-       {"Invalid or missing entitlement: com.vantrel.private.brisvale.allowedSPI", listed}},
-      {"absent", std::nullopt,
-       {"Invalid or missing entitlement: com.vantrel.private.brisvale.allowedSPI", listed}},
-      {"non-string elements skipped",
-       plist::Value(plist::Array{plist::Value::Int(1), "CopyDevices"}), {}},
-  };
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     SCOPED_TRACE(c.name);
     log::CaptureSink capture;
     FakeConnection connection;
     connection.allowedSPI = c.allowed;
     MatchingContext context;
-    EXPECT_TRUE(HandleRequest(context, &connection,
-                              Request(plist::Dictionary{{"RequestType", "CopyDevices"}})));
-    EXPECT_EQ(connection.sent.size(), 1u);
+    EXPECT_EQ(HandleRequest(context, &connection, c.message), c.status != nullptr);
     EXPECT_EQ(capture.Texts(Level::Default), c.lines);
+    if (!c.status) {
+      EXPECT_THAT(connection.sent, IsEmpty());
+      continue;
+    }
+    ASSERT_EQ(connection.sent.size(), 1u);
+    const ipc::Message& reply = connection.sent[0];
+    EXPECT_TRUE(reply.isReply);
+    EXPECT_EQ(reply.replyToken, c.message.replyToken);
+    const plist::Bytes* bytes = reply.body.find("EncodedDictionary")->data();
+    ASSERT_NE(bytes, nullptr);
+    const std::optional<plist::Value> decoded = plist::ReadBinary(*bytes);  // binary whatever the request was
+    ASSERT_TRUE(decoded.has_value());
+    EXPECT_EQ(*decoded->get("Status"), plist::Value(c.status));
   }
 }
 
 TEST(CopyClientName, NamesTheExecutableAndPidAndRefusesAbsentInputs) {
-  struct Case {
-    std::string path;
-    std::string name;
-  };
-  const Case cases[] = {
-      {"/usr/libexec/imgclient", "imgclient<412>"},
-      {"imgclient", "imgclient<412>"},
-      {"", "<412>"},
-      {"/usr/bin/", "<412>"},
-      {"/" + std::string(300, 'a'), std::string(255, 'a') + "<412>"},
-  };
-  for (const Case& c : cases) {
-    FakeConnection connection;
-    connection.executablePath = c.path;
-    EXPECT_EQ(CopyClientName(&connection), c.name) << c.path;
-  }
+  FakeConnection connection;
+  connection.executablePath = "imgclient";  // no directory
+  EXPECT_EQ(CopyClientName(&connection), "imgclient<412>");
+  connection.executablePath = "/" + std::string(300, 'a');  // longer than a name may be
+  EXPECT_EQ(CopyClientName(&connection), std::string(255, 'a') + "<412>");
   // Absent inputs are refused with a line.
   log::CaptureSink capture;
-  FakeConnection connection;
   EXPECT_EQ(CopyClientName(nullptr), std::nullopt);
   EXPECT_FALSE(CheckAllowedSPI(nullptr, "CopyDevices"));
   EXPECT_FALSE(CheckAllowedSPI(&connection, nullptr));
@@ -230,28 +178,35 @@ class FakeIpc : public ipc::IpcService {
 struct DaemonTest : ::testing::Test {
   RunLoop loop;
   FakeIpc ipc;
-  // The other services stay those the test binary installed.
-  ScopedServices services{[this] {
-    Services withFakeIpc = CurrentServices();
-    withFakeIpc.ipc = &ipc;
-    return withFakeIpc;
-  }()};
+  ScopedServices services{Services{&emptyRegistry, &quietOs, &ipc}};
   MatchingContext context;
   std::vector<int> exits;
   Daemon daemon{loop, context, [this](int status) { exits.push_back(status); }};
 };
 
-TEST_F(DaemonTest, ListenerFailureIsLogged) {
+// From a listener that cannot be made, through a connection served, cancelled for a bad
+// message and let go of once closed, to a listener that fails for good.
+TEST_F(DaemonTest, ListenerAndConnectionsFromStartToEnd) {
   log::CaptureSink capture;
   ipc.failListener = true;
   EXPECT_FALSE(daemon.StartServing());
-  EXPECT_THAT(capture.Texts(),
-              ElementsAre("Failed to create vexa listener for com.vantrel.brisvale_mounter.vexa."));
-}
-
-TEST_F(DaemonTest, InvalidListenerEndsTheProcess) {
+  EXPECT_THAT(capture.Texts(), ElementsAre("Failed to create vexa listener for com.vantrel.brisvale_mounter.vexa."));
+  ipc.failListener = false;
   ASSERT_TRUE(daemon.StartServing());
-  log::CaptureSink capture;
+
+  auto connection = std::make_shared<FakeConnection>();
+  ipc.listenerHandler(connection, ipc::EventKind::Message);
+  ASSERT_TRUE(connection->handler);
+  ipc::Message bad;  // no EncodedDictionary: rejected, connection cancelled
+  connection->handler(ipc::EventKind::Message, &bad);
+  EXPECT_TRUE(connection->cancelled);
+  capture.Clear();
+  connection->handler(ipc::EventKind::ConnectionInvalid, nullptr);
+  EXPECT_THAT(capture.Texts(), ElementsAre("connection closed: imgclient<412>"));
+  loop.RunOnce();
+  EXPECT_EQ(daemon.ConnectionCount(), 0u);
+
+  capture.Clear();
   ipc.listenerHandler(nullptr, ipc::EventKind::ConnectionInvalid);
   EXPECT_THAT(exits, ElementsAre(1));
   EXPECT_THAT(capture.Lines(),
@@ -260,46 +215,21 @@ TEST_F(DaemonTest, InvalidListenerEndsTheProcess) {
                                     "com.vantrel.brisvale_mounter.vexa is set in vexa plist."}));
 }
 
-TEST_F(DaemonTest, ConnectionServedThenClosedOnce) {
-  ASSERT_TRUE(daemon.StartServing());
-  log::CaptureSink capture;
-  auto connection = std::make_shared<FakeConnection>();
-  ipc.listenerHandler(connection, ipc::EventKind::Message);
-  ASSERT_TRUE(connection->handler);
-
-  ipc::Message bad;  // no EncodedDictionary: rejected, connection cancelled
-  connection->handler(ipc::EventKind::Message, &bad);
-  EXPECT_TRUE(connection->cancelled);
-
-  capture.Clear();
-  connection->handler(ipc::EventKind::ConnectionInvalid, nullptr);
-  EXPECT_THAT(capture.Texts(), ElementsAre("connection closed: imgclient<412>"));
-  loop.RunOnce();
-  EXPECT_EQ(daemon.ConnectionCount(), 0u);
-}
-
 TEST_F(DaemonTest, HardwareEventsAreRoutedByExactName) {
   ASSERT_TRUE(daemon.StartServing());
   EXPECT_EQ(ipc.streamName, "com.vantrel.kestrix.matching");
-  struct Case {
-    const char* name;
-    bool supported;
-  };
-  const Case cases[] = {
+  const std::pair<std::string, bool> cases[] = {
       {"com.vantrel.brisvale_mounter.attached", true},
       {"com.vantrel.brisvale_mounter.detached", true},
       {"com.vantrel.mobile.ptp_camera", true},
       {"com.vantrel.brisvale_mounter.ATTACHED", false},
-      {"com.vantrel.brisvale_mounter.attached ", false},
-      {"", false},
   };
-  for (const Case& c : cases) {
+  for (const auto& [name, supported] : cases) {
     log::CaptureSink capture;
-    ipc.streamHandler(ipc::StreamEvent{std::string(c.name)});
+    ipc.streamHandler(ipc::StreamEvent{name});
     const std::vector<std::string> lines = capture.Texts();
-    EXPECT_THAT(lines, Contains(std::string("Kestrix Event: ") + c.name));
-    EXPECT_EQ(std::ranges::count(lines, std::string("Unsupported Kestrix Event: ") + c.name), c.supported ? 0 : 1)
-        << c.name;
+    EXPECT_EQ(std::ranges::count(lines, "Kestrix Event: " + name), 1) << name;
+    EXPECT_EQ(std::ranges::count(lines, "Unsupported Kestrix Event: " + name), supported ? 0 : 1) << name;
   }
   log::CaptureSink capture;
   ipc.streamHandler(ipc::StreamEvent{});

@@ -18,7 +18,6 @@ namespace brisvale {
 namespace {
 
 using ::testing::ElementsAre;
-using ::testing::IsEmpty;
 
 // Records each call; a call answers what `results` holds under its name, 0 by default.
 class RecordingOs : public testing::FakeOs {
@@ -54,49 +53,31 @@ class RecordingNotify : public notify::SystemNotify {
   std::vector<std::string> posted;
 };
 
-class UnmountSyncTest : public ::testing::Test {
- protected:
-  UnmountSyncTest() : services_(Services{&registry_, &os, nullptr, &center}) {
+struct UnmountSyncTest : ::testing::Test {
+  UnmountSyncTest() {
     os.mounts = {{0, "ext4", "/private/var/mnt/media1", "/dev/sdb1"},
                  {os::kMountReadOnly, "ext4", "/Developer", "/dev/loop2"}};
     // Known to the registry but not listed as attached media: only the mounts count.
     for (const char* name : {"sdb1", "loop2"}) {
-      registry_.Publish(nullptr, "KxMedia",
+      registry.Publish(nullptr, "KxMedia",
                         {{"BSD Name", name}, {"Content", ""}, {"Removable", plist::Value::Bool(false)},
                          {"Leaf", plist::Value::Bool(true)}});
     }
   }
 
-  std::string Run(void (*handler)(const plist::Value&, plist::Dictionary&), plist::Dictionary request) {
-    plist::Dictionary reply{{"Status", "Failure"}};
-    handler(plist::Value(std::move(request)), reply);
-    return *reply.find("Status")->string();
-  }
-
   RecordingOs os;
   RecordingNotify center;
   log::CaptureSink capture;
-
- private:
-  registry::RegistryModel registry_;
-  ScopedServices services_;
+  registry::RegistryModel registry;
+  ScopedServices services{Services{&registry, &os, nullptr, &center}};
 };
 
-TEST_F(UnmountSyncTest, UnmountRemovesTheMountPointEjectsAndAnnounces) {
-  EXPECT_EQ(Run(HandleUnmount, {{"MountPath", "/private/var/mnt/media1"}}), "Success");
-  EXPECT_THAT(os.calls, ElementsAre("force-unmount /private/var/mnt/media1", "rmdir /private/var/mnt/media1",
-                                    "open /dev/sdb1", "eject"));
-  EXPECT_THAT(center.posted, ElementsAre("com.vantrel.brisvale_unmounted"));
-
-  // The developer directory is part of the system image and stays.
-  os.calls.clear();
-  EXPECT_EQ(Run(HandleUnmount, {{"MountPath", "/Developer"}}), "Success");
-  EXPECT_THAT(os.calls, ElementsAre("force-unmount /Developer", "open /dev/loop2", "eject"));
-}
-
-TEST_F(UnmountSyncTest, UnmountFailuresLogTheirLineAndLeaveTheRest) {
+// Every call the handlers make fails in turn: each failure's line, and how many calls
+// ran, which pins their order too; then each request succeeds.
+TEST_F(UnmountSyncTest, EachStepFailsWithItsLineAndLeavesTheRest) {
   struct Case {
     const char* name;
+    void (*handler)(const plist::Value&, plist::Dictionary&);
     plist::Dictionary request;
     const char* failing;  // the call that answers `result`
     int result;
@@ -107,21 +88,30 @@ TEST_F(UnmountSyncTest, UnmountFailuresLogTheirLineAndLeaveTheRest) {
   };
   const plist::Dictionary media1{{"MountPath", "/private/var/mnt/media1"}};
   const Case cases[] = {
-      {"no path", {}, "", 0, "Failure", {"Invalid value for MountPath: (null)"}, 0, 0},
-      {"path not text", {{"MountPath", plist::Value::Int(3)}}, "", 0, "Failure",
+      {"unmount: path not text", HandleUnmount, {{"MountPath", plist::Value::Int(3)}}, "", 0, "Failure",
        {"Invalid value for MountPath: 3"}, 0, 0},
-      {"unknown path", {{"MountPath", "/private/var/mnt/other"}}, "", 0, "Failure",
+      {"unmount: unknown path", HandleUnmount, {{"MountPath", "/private/var/mnt/other"}}, "", 0, "Failure",
        {"There is no matching entry in the device map for /private/var/mnt/other."}, 0, 0},
-      {"unmount refused", media1, "force-unmount", -EPERM, "Failure",
+      {"unmount refused", HandleUnmount, media1, "force-unmount", -EPERM, "Failure",
        {"Failed to force unmount /private/var/mnt/media1: " + std::string(strerror(EPERM))}, 1, 0},
-      {"directory not empty", media1, "rmdir", -ENOTEMPTY, "Failure",
+      {"directory not empty", HandleUnmount, media1, "rmdir", -ENOTEMPTY, "Failure",
        {"Failed to remove /private/var/mnt/media1: " + std::string(strerror(ENOTEMPTY))}, 2, 0},
-      {"open fails", media1, "open", -ENOENT, "Success", {"Failed to open /dev/sdb1 : 2"}, 3, 1},
-      {"eject fails", media1, "eject", -ENOTTY, "Success", {"Failed to eject /dev/sdb1 : 25"}, 4, 1},
+      {"open fails", HandleUnmount, media1, "open", -ENOENT, "Success", {"Failed to open /dev/sdb1 : 2"}, 3, 1},
+      {"eject fails", HandleUnmount, media1, "eject", -ENOTTY, "Success", {"Failed to eject /dev/sdb1 : 25"}, 4, 1},
       // The mount table's source names a device that does not hold the file system.
-      {"node is another device", media1, "node device", 2, "Success", {"Failed to eject /dev/sdb1 : 19"}, 3, 1},
-      {"no device holds the mount", media1, "mounted device", -ENODEV, "Success",
+      {"node is another device", HandleUnmount, media1, "node device", 2, "Success",
+       {"Failed to eject /dev/sdb1 : 19"}, 3, 1},
+      {"no device holds the mount", HandleUnmount, media1, "mounted device", -ENODEV, "Success",
        {"Failed to eject /dev/sdb1 : 19"}, 2, 1},
+      {"sync: no path", HandleSync, {}, "", 0, "Failure", {"Failed to extract MountPath from request"}, 0, 0},
+      {"sync: unknown path", HandleSync, {{"MountPath", "/private/var/mnt/nothing"}}, "", 0, "Failure",
+       {"There is no matching entry for /private/var/mnt/nothing."}, 0, 0},
+      {"sync fails", HandleSync, media1, "sync", -EIO, "Failure",
+       {"Failed to force the sync /private/var/mnt/media1: 5"}, 1, 0},
+      {"sync", HandleSync, {{"MountPath", "/Developer"}}, "", 0, "Success", {}, 1, 0},
+      // The developer directory is part of the system image and stays.
+      {"unmount the developer directory", HandleUnmount, {{"MountPath", "/Developer"}}, "", 0, "Success", {}, 3, 1},
+      {"unmount", HandleUnmount, media1, "", 0, "Success", {}, 4, 1},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
@@ -129,31 +119,17 @@ TEST_F(UnmountSyncTest, UnmountFailuresLogTheirLineAndLeaveTheRest) {
     os.calls.clear();
     center.posted.clear();
     capture.Clear();
-    EXPECT_EQ(Run(HandleUnmount, c.request), c.status);
+    plist::Dictionary reply{{"Status", "Failure"}};
+    c.handler(plist::Value(c.request), reply);
+    EXPECT_EQ(reply, (plist::Dictionary{{"Status", c.status}}));
     EXPECT_EQ(capture.Texts(log::Level::Default), c.lines);
     EXPECT_EQ(os.calls.size(), c.calls);
     EXPECT_EQ(center.posted.size(), c.posted);
   }
-}
-
-TEST_F(UnmountSyncTest, SyncHasItsOwnLines) {
-  EXPECT_EQ(Run(HandleSync, {{"MountPath", "/Developer"}}), "Success");
-  EXPECT_THAT(os.calls, ElementsAre("sync /Developer"));
-  EXPECT_THAT(capture.Texts(log::Level::Default), IsEmpty());
-
-  const std::pair<plist::Dictionary, std::string> failures[] = {
-      {{}, "Failed to extract MountPath from request"},
-      {{{"MountPath", "/private/var/mnt/nothing"}}, "There is no matching entry for /private/var/mnt/nothing."},
-  };
-  for (const auto& [request, line] : failures) {
-    capture.Clear();
-    EXPECT_EQ(Run(HandleSync, request), "Failure");
-    EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre(line));
-  }
-  os.results["sync"] = -EIO;
-  capture.Clear();
-  EXPECT_EQ(Run(HandleSync, {{"MountPath", "/private/var/mnt/media1"}}), "Failure");
-  EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre("Failed to force the sync /private/var/mnt/media1: 5"));
+  // The last row ran every step, on the mount point and the device the mount table names.
+  EXPECT_THAT(os.calls, ElementsAre("force-unmount /private/var/mnt/media1", "rmdir /private/var/mnt/media1",
+                                    "open /dev/sdb1", "eject"));
+  EXPECT_THAT(center.posted, ElementsAre("com.vantrel.brisvale_unmounted"));
 }
 
 }  // namespace
