@@ -130,6 +130,11 @@ TEST_F(UnmountSyncTest, EachStepFailsWithItsLineAndLeavesTheRest) {
   EXPECT_THAT(os.calls, ElementsAre("force-unmount /private/var/mnt/media1", "rmdir /private/var/mnt/media1",
                                     "open /dev/sdb1", "eject"));
   EXPECT_THAT(center.posted, ElementsAre("com.vantrel.brisvale_unmounted"));
+  // The developer directory is unmounted and its loop device let go, but never removed.
+  os.calls.clear();
+  plist::Dictionary reply;
+  HandleUnmount(plist::Value(plist::Dictionary{{"MountPath", "/Developer"}}), reply);
+  EXPECT_THAT(os.calls, ElementsAre("force-unmount /Developer", "open /dev/loop2", "eject"));
 }
 
 }  // namespace
