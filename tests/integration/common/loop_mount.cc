@@ -6,10 +6,13 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <gtest/gtest.h>
+
 #include <cerrno>
 #include <cstring>
 
 #include "base/unique_fd.h"
+#include "platform/linux/os_system.h"
 #include "sandbox_daemon.h"
 
 namespace brisvale::testing {
@@ -23,6 +26,16 @@ bool MakeExt4Image(const std::string& imagePath, int sizeMiB, const std::string&
   if (RunProgram(argv, &output) == 0) return true;
   if (error) *error = "mkfs.ext4 failed: " + output;
   return false;
+}
+
+std::vector<std::string> MountPointsBelow(const std::string& dir) {
+  std::vector<os::MountRecord> table;
+  EXPECT_GE(os::ReadWholeMountTable("/proc/self/mountinfo", table), 0);
+  std::vector<std::string> found;
+  for (const os::MountRecord& mount : table) {
+    if (mount.mountedOn == dir || mount.mountedOn.starts_with(dir + "/")) found.push_back(mount.mountedOn);
+  }
+  return found;
 }
 
 std::unique_ptr<LoopMount> LoopMount::Create(const std::string& imagePath, const std::string& mountPoint,
@@ -44,8 +57,7 @@ std::unique_ptr<LoopMount> LoopMount::Create(const std::string& imagePath, const
   }
   const std::string device = "/dev/" + mount->loop_.name();
   const std::string node = devRoot + "/" + mount->loop_.name();
-  struct stat status {};
-  if (stat(node.c_str(), &status) != 0) {
+  if (access(node.c_str(), F_OK) != 0) {
     if (mknod(node.c_str(), S_IFBLK | 0660, mount->loop_.deviceNumber()) != 0) return fail("mknod " + node, errno);
     mount->nodeCreated_ = node;
   }

@@ -4,6 +4,7 @@
 
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "platform/linux/loop_device.h"
 
@@ -13,6 +14,10 @@ namespace brisvale::testing {
 // empty). false with a message in `error` when mkfs fails.
 bool MakeExt4Image(const std::string& imagePath, int sizeMiB, const std::string& contentDir,
                    std::string* error);
+
+// What the kernel has mounted at or below `dir`, one entry a mount (stacked mounts
+// count twice).
+std::vector<std::string> MountPointsBelow(const std::string& dir);
 
 class LoopMount {
  public:
@@ -28,7 +33,6 @@ class LoopMount {
 
   // "/dev/loopN", as the mount table and the daemon name it.
   const std::string& device() const { return device_; }
-  const std::string& mountPoint() const { return mountPoint_; }
 
  private:
   LoopMount() = default;
