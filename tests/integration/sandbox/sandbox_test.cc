@@ -62,7 +62,11 @@ class SandboxRoot : public ::testing::Test {
   const std::string dir_ = scratch_.str();
 };
 
-TEST_F(SandboxRoot, ChildSeesAWorkingDeviceLikeRootAndRestartsReuseTheBinds) {
+// A child sees a working device-like root, also after a restart, which reuses the binds.
+// A loop-mounted image made inside (attached without autoclear), a bind of an outside
+// directory and a link out: the teardown unmounts and detaches what is below and leaves
+// the rest.
+TEST_F(SandboxRoot, WorksLikeADeviceRootAndTeardownClearsWhatIsInsideAndNothingElse) {
   auto probe = [&] {
     std::string failed = Enter(dir_);
     if (!failed.empty()) return failed;
@@ -82,12 +86,7 @@ TEST_F(SandboxRoot, ChildSeesAWorkingDeviceLikeRootAndRestartsReuseTheBinds) {
   const auto mounts = MountPointsBelow(dir_);
   for (const char* tree : {"/proc", "/sys", "/usr"}) EXPECT_EQ(std::ranges::count(mounts, dir_ + tree), 1) << tree;
   EXPECT_EQ(mounts.size(), 3u);
-}
 
-// A loop-mounted image (attached without autoclear), a bind of an outside directory and
-// a link out: the teardown unmounts and detaches what is below and leaves the rest.
-TEST_F(SandboxRoot, MountsMadeInsideShowOutsideAndTeardownClearsThemAndNothingElse) {
-  ASSERT_EQ(InChild([&] { return Enter(dir_); }), "");
   const brisvale::testing::ScratchDir content, outside;
   std::ofstream(content / "hello") << "world";
   std::string error;
@@ -125,7 +124,19 @@ TEST_F(SandboxRoot, MountsMadeInsideShowOutsideAndTeardownClearsThemAndNothingEl
   EXPECT_TRUE(TeardownSandboxRoot(dir_, &error)) << "a second teardown finds nothing to do";
 }
 
-TEST_F(SandboxRoot, BadDirectoriesAreRefusedClearlyAndLeftAlone) {
+// Without the privileges it needs, or in a directory that cannot be one, no root is made.
+TEST_F(SandboxRoot, WithoutPrivilegesOrInBadDirectoriesNothingIsCreated) {
+  const std::string report = InChild([&] {
+    __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
+    __user_cap_data_struct data[2]{};
+    syscall(SYS_capget, &header, data);
+    data[CAP_MKNOD / 32].effective &= ~(1u << (CAP_MKNOD % 32));
+    if (syscall(SYS_capset, &header, data) != 0) return std::string("capset failed");
+    return Enter(dir_);
+  });
+  EXPECT_NE(report.find("needs root"), std::string::npos) << report;
+  EXPECT_TRUE(fs::is_empty(dir_));
+
   const std::string file = dir_ + "/file", sub = dir_ + "/sub";
   std::ofstream(file) << "x";
   // A /var that is not the link: a clear error instead of a half-right root.
@@ -146,19 +157,6 @@ TEST_F(SandboxRoot, BadDirectoriesAreRefusedClearlyAndLeftAlone) {
   EXPECT_TRUE(TeardownSandboxRoot(dir_ + "/missing", &error)) << error;
   EXPECT_TRUE(TeardownSandboxRoot(sub, &error)) << error;
   EXPECT_FALSE(fs::exists(sub));
-}
-
-TEST_F(SandboxRoot, WithoutPrivilegesNothingIsCreated) {
-  const std::string report = InChild([&] {
-    __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
-    __user_cap_data_struct data[2]{};
-    syscall(SYS_capget, &header, data);
-    data[CAP_MKNOD / 32].effective &= ~(1u << (CAP_MKNOD % 32));
-    if (syscall(SYS_capset, &header, data) != 0) return std::string("capset failed");
-    return Enter(dir_);
-  });
-  EXPECT_NE(report.find("needs root"), std::string::npos) << report;
-  EXPECT_TRUE(fs::is_empty(dir_));
 }
 
 TEST(FilesystemLayout, HostWithoutPrivateVarIsRefused) {
