@@ -48,10 +48,7 @@ std::unique_ptr<LoopMount> LoopMount::Create(const std::string& imagePath, const
   std::unique_ptr<LoopMount> mount(new LoopMount);
   const UniqueFd image(open(imagePath.c_str(), (readOnly ? O_RDONLY : O_RDWR) | O_CLOEXEC));
   if (!image) return fail("open " + imagePath, errno);
-  loop::AttachOptions options;
-  options.readOnly = readOnly;
-  options.autoclear = true;
-  options.identifier = imagePath;
+  const loop::AttachOptions options{.readOnly = readOnly, .autoclear = true, .identifier = imagePath};
   if (const int rc = loop::Attach(image.get(), options, mount->loop_); rc < 0) {
     return fail("attach " + imagePath, -rc);
   }

@@ -27,9 +27,7 @@ class LoopMount {
   static std::unique_ptr<LoopMount> Create(const std::string& imagePath, const std::string& mountPoint,
                                            const std::string& devRoot, bool readOnly,
                                            std::string* error);
-  ~LoopMount();
-  LoopMount(const LoopMount&) = delete;
-  LoopMount& operator=(const LoopMount&) = delete;
+  ~LoopMount();  // not copyable: the loop device has one owner
 
   // "/dev/loopN", as the mount table and the daemon name it.
   const std::string& device() const { return device_; }

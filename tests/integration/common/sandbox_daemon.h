@@ -16,13 +16,11 @@
 
 namespace brisvale::testing {
 
+// Not copyable: it owns the daemon process and, through its scratch directory, the sandbox.
 class SandboxDaemon {
  public:
   // The sandbox directory starts empty; Start() runs the daemon in it.
-  SandboxDaemon() = default;
   ~SandboxDaemon();
-  SandboxDaemon(const SandboxDaemon&) = delete;
-  SandboxDaemon& operator=(const SandboxDaemon&) = delete;
 
   // Starts the daemon with --root, --verbose and `extraArguments`; waits until it listens.
   bool Start(const std::vector<std::string>& extraArguments = {});

@@ -1,7 +1,7 @@
 // Removable media against the real daemon in a sandbox root, in one run: simulated sticks
 // mounted by the client command's request, plugged and pulled by editing the devices file
 // and checked and mounted by the tool doubles, the keep-alive count each event holds, a
-// camera announced and listed, and failures shown, answered and cancelled through the
+// camera announced, and failures shown, answered and cancelled through the
 // console alert agent. (The request's cases are the handler's unit test.)
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -10,7 +10,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <array>
 #include <filesystem>
 #include <fstream>
@@ -126,7 +125,7 @@ TEST(RemovableMediaTest, MountedOnRequestAndOnEventsPulledAndFailuresShownByTheA
   EXPECT_GE(*fell, kInterval - 100ms) << "released before its interval";
 
   // Plugged in: the dirty stick is repaired and mounted read/write, the stick mounted
-  // already is left alone, and the camera is announced and listed.
+  // already is left alone, and the camera is announced.
   std::string error;
   const auto subscriber = notify::Subscriber::Create(daemon.Path("/private/var/run/vexa/notify"), &error);
   ASSERT_TRUE(subscriber) << error;
@@ -146,11 +145,6 @@ TEST(RemovableMediaTest, MountedOnRequestAndOnEventsPulledAndFailuresShownByTheA
   EXPECT_EQ(received(), (Notifications{{"com.vantrel.mobile.camera_attached", plist::Value(camera)},
                                        {"com.vantrel.brisvale_mounted", plist::Value()}}));
   EXPECT_THAT(MountOptions(daemon.Path("/private/var/mnt/mount2")), StartsWith("/dev/sdb1 tmpfs rw,nosuid,nodev"));
-  std::optional<plist::Value> devices;
-  ASSERT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}, &devices).ok());
-  const plist::Value* listed = devices ? devices->get("EntryList") : nullptr;
-  ASSERT_TRUE(listed && listed->array());
-  EXPECT_EQ(std::ranges::count(*listed->array(), plist::Value(camera)), 1);
 
   // The console agent shows each alert and answers on Enter; when every stick is pulled
   // without an eject, their mounts and mount points go and the alert still up is cancelled.
@@ -171,7 +165,6 @@ TEST(RemovableMediaTest, MountedOnRequestAndOnEventsPulledAndFailuresShownByTheA
   EXPECT_TRUE(WaitForText(agentOutput, "\"event\": \"listening\""));
   writeDevices({Stick("sde1")});
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
-  EXPECT_TRUE(daemon.WaitForLogLine("default: Failed to mount /dev/sde1."));
   EXPECT_TRUE(WaitForText(agentOutput, "\"title\": \"Cannot Use Storage Device\""));
   ASSERT_EQ(write(enter.get(), "\n", 1), 1);
   EXPECT_TRUE(WaitForText(agentOutput, "\"event\": \"answered\""));

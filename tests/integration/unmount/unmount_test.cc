@@ -4,7 +4,6 @@
 // links, flags, special files and mounts inside stale trees, are the unit tests'.)
 #include <fcntl.h>
 #include <sys/mount.h>
-#include <unistd.h>
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
