@@ -1,5 +1,6 @@
 // A real file system for integration tests: an ext4 image built without root, attached
-// to a loop device and mounted, all released in the destructor, also when a test fails.
+// to a loop device and mounted, all released in the destructor, also when a test fails;
+// and what the kernel has mounted where.
 #pragma once
 
 #include <memory>

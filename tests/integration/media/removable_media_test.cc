@@ -1,8 +1,8 @@
 // Removable media against the real daemon in a sandbox root, in one run: simulated sticks
 // mounted by the client command's request, plugged and pulled by editing the devices file
 // and checked and mounted by the tool doubles, the keep-alive count each event holds, a
-// camera announced, and failures shown, answered and cancelled through the
-// console alert agent. (The request's cases are the handler's unit test.)
+// camera announced, and failures shown, answered and cancelled through the console alert
+// agent. (The cases of each are the in-process tests', in tests/unit/media.)
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <fcntl.h>
@@ -94,7 +94,7 @@ bool WaitForText(const std::string& path, const std::string& text) {
   return false;
 }
 
-TEST(RemovableMediaTest, MountedOnRequestAndOnEventsPulledAndFailuresShownByTheAgent) {
+TEST(RemovableMediaTest, MountedOnRequestAndOnEventsHeldAlivePulledAndFailuresShownByTheAgent) {
   BRISVALE_REQUIRE_ROOT();
   SandboxDaemon daemon;
   const auto writeDevices = [&](plist::Array objects) {
@@ -115,7 +115,7 @@ TEST(RemovableMediaTest, MountedOnRequestAndOnEventsPulledAndFailuresShownByTheA
   // Each hardware event renews a subscription, which holds one transaction for the
   // keep-alive interval (the stick is mounted already: the events find nothing to do).
   constexpr auto kInterval = 1500ms;
-  ASSERT_TRUE(TimeUntilCount(daemon, 0, Clock::now(), 10s));  // the start-up subscriptions' go first
+  ASSERT_TRUE(TimeUntilCount(daemon, 0, Clock::now(), 10s));  // the start-up subscriptions' end first
   const Clock::time_point posted = Clock::now();
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.mobile.ptp_camera").ok());

@@ -1,4 +1,5 @@
-// The inventory over a registry model and a fake mount table: map entries and lookups.
+// The inventory over a registry model and a fake mount table: which media, mounts and
+// cameras it lists, and the entry each gets.
 #include "inventory/inventory.h"
 
 #include <gmock/gmock.h>
