@@ -14,12 +14,10 @@ namespace brisvale::testing {
 class FakeOs : public os::Os {
  public:
   std::vector<os::MountRecord> mounts;
-  int mountTableError = 0;  // -errno answered by GetMountTable when set
   // Volume headers by device path; a path not listed fails to open with ENOENT.
   std::map<std::string, std::vector<uint8_t>, std::less<>> volumeHeaders;
 
   int GetMountTable(std::span<os::MountRecord> records) override {
-    if (mountTableError) return mountTableError;
     if (records.empty()) return static_cast<int>(mounts.size());
     const size_t count = std::min(records.size(), mounts.size());
     std::copy_n(mounts.begin(), count, records.begin());

@@ -6,10 +6,13 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <gtest/gtest.h>
+
 #include <cerrno>
 #include <cstring>
 
 #include "base/unique_fd.h"
+#include "platform/linux/os_system.h"
 #include "sandbox_daemon.h"
 
 namespace brisvale::testing {
@@ -25,6 +28,16 @@ bool MakeExt4Image(const std::string& imagePath, int sizeMiB, const std::string&
   return false;
 }
 
+std::vector<std::string> MountPointsBelow(const std::string& dir) {
+  std::vector<os::MountRecord> table;
+  EXPECT_GE(os::ReadWholeMountTable("/proc/self/mountinfo", table), 0);
+  std::vector<std::string> found;
+  for (const os::MountRecord& mount : table) {
+    if (mount.mountedOn == dir || mount.mountedOn.starts_with(dir + "/")) found.push_back(mount.mountedOn);
+  }
+  return found;
+}
+
 std::unique_ptr<LoopMount> LoopMount::Create(const std::string& imagePath, const std::string& mountPoint,
                                              const std::string& devRoot, bool readOnly,
                                              std::string* error) {
@@ -35,17 +48,13 @@ std::unique_ptr<LoopMount> LoopMount::Create(const std::string& imagePath, const
   std::unique_ptr<LoopMount> mount(new LoopMount);
   const UniqueFd image(open(imagePath.c_str(), (readOnly ? O_RDONLY : O_RDWR) | O_CLOEXEC));
   if (!image) return fail("open " + imagePath, errno);
-  loop::AttachOptions options;
-  options.readOnly = readOnly;
-  options.autoclear = true;
-  options.identifier = imagePath;
+  const loop::AttachOptions options{.readOnly = readOnly, .autoclear = true, .identifier = imagePath};
   if (const int rc = loop::Attach(image.get(), options, mount->loop_); rc < 0) {
     return fail("attach " + imagePath, -rc);
   }
   const std::string device = "/dev/" + mount->loop_.name();
   const std::string node = devRoot + "/" + mount->loop_.name();
-  struct stat status {};
-  if (stat(node.c_str(), &status) != 0) {
+  if (access(node.c_str(), F_OK) != 0) {
     if (mknod(node.c_str(), S_IFBLK | 0660, mount->loop_.deviceNumber()) != 0) return fail("mknod " + node, errno);
     mount->nodeCreated_ = node;
   }

@@ -1,9 +1,11 @@
 // A real file system for integration tests: an ext4 image built without root, attached
-// to a loop device and mounted, all released in the destructor, also when a test fails.
+// to a loop device and mounted, all released in the destructor, also when a test fails;
+// and what the kernel has mounted where.
 #pragma once
 
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "platform/linux/loop_device.h"
 
@@ -14,6 +16,10 @@ namespace brisvale::testing {
 bool MakeExt4Image(const std::string& imagePath, int sizeMiB, const std::string& contentDir,
                    std::string* error);
 
+// What the kernel has mounted at or below `dir`, one entry a mount (stacked mounts
+// count twice).
+std::vector<std::string> MountPointsBelow(const std::string& dir);
+
 class LoopMount {
  public:
   // Attaches `imagePath` to a free loop device (read-only when asked), creates the
@@ -22,13 +28,10 @@ class LoopMount {
   static std::unique_ptr<LoopMount> Create(const std::string& imagePath, const std::string& mountPoint,
                                            const std::string& devRoot, bool readOnly,
                                            std::string* error);
-  ~LoopMount();
-  LoopMount(const LoopMount&) = delete;
-  LoopMount& operator=(const LoopMount&) = delete;
+  ~LoopMount();  // not copyable: the loop device has one owner
 
   // "/dev/loopN", as the mount table and the daemon name it.
   const std::string& device() const { return device_; }
-  const std::string& mountPoint() const { return mountPoint_; }
 
  private:
   LoopMount() = default;

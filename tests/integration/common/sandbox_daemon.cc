@@ -3,7 +3,6 @@
 
 #include <fcntl.h>
 #include <signal.h>
-#include <stdlib.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -12,6 +11,7 @@
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <thread>
 
 #include "platform/linux/os_sandbox.h"
@@ -19,16 +19,16 @@
 namespace brisvale::testing {
 namespace {
 
-constexpr const char* kServiceName = "com.vantrel.brisvale_mounter.vexa";
 constexpr const char* kHardwareEventStream = "com.vantrel.kestrix.matching";
 
-bool WaitForExit(pid_t pid, std::chrono::milliseconds timeout) {
-  for (auto deadline = std::chrono::steady_clock::now() + timeout; std::chrono::steady_clock::now() < deadline;) {
-    const pid_t done = waitpid(pid, nullptr, WNOHANG);
-    if (done == pid || (done < 0 && errno == ECHILD)) return true;
+// Asks `done` every few milliseconds until it holds (true) or `timeout` has passed.
+bool PollUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (!done()) {
+    if (std::chrono::steady_clock::now() >= deadline) return false;
     std::this_thread::sleep_for(std::chrono::milliseconds(5));
   }
-  return false;
+  return true;
 }
 
 [[noreturn]] void Exec(const std::vector<std::string>& arguments) {
@@ -52,79 +52,57 @@ SandboxDaemon::~SandboxDaemon() {
   unlink(logPath_.c_str());
 }
 
-std::string SandboxDaemon::ServiceSocket() const {
-  return Path("/private/var/run/vexa/") + kServiceName;
-}
-
-std::string SandboxDaemon::EventsSocket() const { return Path("/private/var/run/vexa/events"); }
-
-bool SandboxDaemon::Start(const std::vector<std::string>& extraArguments, int listenFd) {
+bool SandboxDaemon::Start(const std::vector<std::string>& extraArguments) {
   if (pid_ > 0) return false;
   std::vector<std::string> arguments = {BRISVALE_DAEMON_PATH, "--root", root_, "--verbose"};
   arguments.insert(arguments.end(), extraArguments.begin(), extraArguments.end());
   pid_ = fork();
   if (pid_ < 0) return false;
   if (pid_ == 0) {
-    int log = open(logPath_.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
+    const int log = open(logPath_.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
     if (log >= 0) dup2(log, STDERR_FILENO);
-    if (listenFd >= 0) {
-      if (listenFd != 3) dup2(listenFd, 3);
-      fcntl(3, F_SETFD, 0);
-      setenv("LISTEN_FDS", "1", 1);
-      setenv("LISTEN_PID", std::to_string(getpid()).c_str(), 1);
-    }
     Exec(arguments);
   }
-  // Listening once a client can connect. A daemon given its listener by activation
-  // binds only the events socket itself.
-  const std::string readySocket = listenFd >= 0 ? EventsSocket() : ServiceSocket();
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-  while (std::chrono::steady_clock::now() < deadline) {
-    if (ipc::Client::Connect(readySocket)) return true;
-    if (waitpid(pid_, nullptr, WNOHANG) == pid_) {  // exited before it listened
-      pid_ = -1;
-      return false;
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  }
-  return false;
+  // Listening once a client can connect; a daemon that exited first never will.
+  bool exited = false;
+  const bool listening = PollUntil([&] {
+    if (ipc::Client::Connect(ServiceSocket())) return true;
+    exited = waitpid(pid_, nullptr, WNOHANG) == pid_;
+    return exited;
+  }, std::chrono::seconds(10));
+  if (exited) pid_ = -1;
+  return listening && !exited;
 }
 
 void SandboxDaemon::Stop() {
   if (pid_ <= 0) return;
   kill(pid_, SIGTERM);
-  if (!WaitForExit(pid_, std::chrono::seconds(5))) {
+  const auto exited = [this] {
+    const pid_t done = waitpid(pid_, nullptr, WNOHANG);
+    return done == pid_ || (done < 0 && errno == ECHILD);
+  };
+  if (!PollUntil(exited, std::chrono::seconds(5))) {
     kill(pid_, SIGKILL);
     waitpid(pid_, nullptr, 0);
   }
   pid_ = -1;
 }
 
-ipc::ClientReply SandboxDaemon::SendEncoded(const plist::Bytes& encoded,
+ipc::ClientReply SandboxDaemon::SendRequest(const plist::Value& request,
                                             std::optional<plist::Value>* decodedReply) {
   ipc::ClientReply failure;
   std::optional<ipc::Client> client = ipc::Client::Connect(ServiceSocket(), &failure);
   if (!client) return failure;
-  ipc::ClientReply reply =
-      client->Request(plist::Dictionary{{"EncodedDictionary", plist::Value(encoded)}},
-                      std::chrono::seconds(30));
-  if (reply.ok() && decodedReply) {
-    const plist::Value* bytes = reply.body.find("EncodedDictionary");
-    if (bytes && bytes->data()) {
-      // Replies are always binary property lists.
-      *decodedReply = plist::ReadBinary(*bytes->data());
-    }
-  }
+  const plist::Dictionary wrapped{{"EncodedDictionary", plist::Value(plist::WriteBinary(request))}};
+  ipc::ClientReply reply = client->Request(wrapped, std::chrono::seconds(30));
+  const plist::Value* bytes = reply.ok() ? reply.body.find("EncodedDictionary") : nullptr;
+  // Replies are always binary property lists.
+  if (decodedReply && bytes && bytes->data()) *decodedReply = plist::ReadBinary(*bytes->data());
   return reply;
 }
 
-ipc::ClientReply SandboxDaemon::SendRequest(const plist::Value& request,
-                                            std::optional<plist::Value>* decodedReply) {
-  return SendEncoded(plist::WriteBinary(request), decodedReply);
-}
-
 ipc::ClientReply SandboxDaemon::PostHardwareEvent(const std::string& name) {
-  return ipc::PostEvent(EventsSocket(), kHardwareEventStream, name);
+  return ipc::PostEvent(Path("/private/var/run/vexa/events"), kHardwareEventStream, name);
 }
 
 std::vector<std::string> SandboxDaemon::LogLines() const {
@@ -138,14 +116,8 @@ bool SandboxDaemon::LogContains(const std::string& line) const {
   return std::ranges::count(LogLines(), line) > 0;
 }
 
-bool SandboxDaemon::WaitForLogLine(const std::string& line,
-                                   std::chrono::milliseconds timeout) const {
-  auto deadline = std::chrono::steady_clock::now() + timeout;
-  do {
-    if (LogContains(line)) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  } while (std::chrono::steady_clock::now() < deadline);
-  return false;
+bool SandboxDaemon::WaitForLogLine(const std::string& line, std::chrono::milliseconds timeout) const {
+  return PollUntil([&] { return LogContains(line); }, timeout);
 }
 
 int RunProgram(const std::vector<std::string>& argv, std::string* output) {

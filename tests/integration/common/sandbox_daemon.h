@@ -1,6 +1,5 @@
-// The real daemon in a throw-away sandbox root, for integration tests: started in the
-// constructor (or on demand), stopped, and the sandbox torn down, in the destructor,
-// also when a test fails half-way.
+// The real daemon in a throw-away sandbox root, for integration tests: started on demand,
+// stopped, and the sandbox torn down, in the destructor, also when a test fails half-way.
 #pragma once
 
 #include <sys/types.h>
@@ -17,31 +16,25 @@
 
 namespace brisvale::testing {
 
+// Not copyable: it owns the daemon process and, through its scratch directory, the sandbox.
 class SandboxDaemon {
  public:
   // The sandbox directory starts empty; Start() runs the daemon in it.
-  SandboxDaemon() = default;
   ~SandboxDaemon();
-  SandboxDaemon(const SandboxDaemon&) = delete;
-  SandboxDaemon& operator=(const SandboxDaemon&) = delete;
 
-  // Starts the daemon with --root, --verbose and `extraArguments`; waits until it
-  // listens. `listenFd`, when given, is passed by socket activation as descriptor 3.
-  bool Start(const std::vector<std::string>& extraArguments = {}, int listenFd = -1);
+  // Starts the daemon with --root, --verbose and `extraArguments`; waits until it listens.
+  bool Start(const std::vector<std::string>& extraArguments = {});
   // Ends the daemon (SIGTERM, then SIGKILL) and waits for it; the sandbox stays.
   void Stop();
-  bool Running() const { return pid_ > 0; }
   pid_t pid() const { return pid_; }
 
   const std::string& root() const { return root_; }
   // A path inside the sandbox, as seen from outside ("/private/var" -> root + that).
   std::string Path(const std::string& inside) const { return root_ + inside; }
-  std::string ServiceSocket() const;
-  std::string EventsSocket() const;
+  std::string ServiceSocket() const { return Path("/private/var/run/vexa/com.vantrel.brisvale_mounter.vexa"); }
 
-  // One request {"EncodedDictionary": bytes}; the reply's decoded dictionary when Ok.
-  ipc::ClientReply SendEncoded(const plist::Bytes& encoded,
-                               std::optional<plist::Value>* decodedReply = nullptr);
+  // One request {"EncodedDictionary": the binary `request`}; the reply's decoded
+  // dictionary when Ok.
   ipc::ClientReply SendRequest(const plist::Value& request,
                                std::optional<plist::Value>* decodedReply = nullptr);
   ipc::ClientReply PostHardwareEvent(const std::string& name);

@@ -1,7 +1,8 @@
-// Removable media against the real daemon in a sandbox root: simulated sticks mounted by
-// request, and plugged and pulled by editing the devices file, checked and mounted by
-// the tool doubles; failures shown, answered and cancelled through the console alert
-// agent; simulated cameras announced.
+// Removable media against the real daemon in a sandbox root, in one run: simulated sticks
+// mounted by the client command's request, plugged and pulled by editing the devices file
+// and checked and mounted by the tool doubles, the keep-alive count each event holds, a
+// camera announced, and failures shown, answered and cancelled through the console alert
+// agent. (The cases of each are the in-process tests', in tests/unit/media.)
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <fcntl.h>
@@ -9,12 +10,12 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <array>
 #include <filesystem>
 #include <fstream>
 #include <thread>
 
 #include "base/unique_fd.h"
-#include "media_doubles.h"
 #include "platform/linux/notify_center.h"
 #include "plist_printers.h"
 #include "sandbox_daemon.h"
@@ -22,39 +23,43 @@
 namespace brisvale::testing {
 namespace {
 
+namespace fs = std::filesystem;
 using namespace std::chrono_literals;
 using ::testing::StartsWith;
+using Notifications = std::vector<std::pair<std::string, plist::Value>>;
+using Clock = std::chrono::steady_clock;
 
-plist::Value Medium(const std::string& bsdName, bool removable, bool leaf, const std::string& content) {
-  return DeviceObject(bsdName, "KxMedia",
-                      {{"BSD Name", plist::Value(bsdName)}, {"Content", plist::Value(content)},
-                       {"Removable", plist::Value::Bool(removable)}, {"Leaf", plist::Value::Bool(leaf)},
-                       {"Writable", plist::Value::Bool(true)}});
+// The check and mount tool doubles at the sandbox's /sbin and the simulated `volumes`
+// ({bsdName, kind, marker}) at its /dev, from scripts/doubles (which the demo uses too):
+// the marker ("dirty", "broken" or none) tells the checker double what to answer.
+bool PrepareSandbox(const SandboxDaemon& daemon, const std::vector<std::array<std::string, 3>>& volumes) {
+  std::error_code error;
+  fs::create_directories(daemon.Path("/sbin"), error);
+  fs::create_directories(daemon.Path("/dev"), error);
+  for (const char* tool : {"fsck_hfs", "mount_hfs"}) {
+    fs::copy_file(fs::path(BRISVALE_DOUBLES_DIR) / tool, daemon.Path(std::string("/sbin/") + tool),
+                  fs::copy_options::overwrite_existing, error);
+    if (error) return false;
+  }
+  for (const auto& [bsdName, kind, marker] : volumes) {
+    std::vector<std::string> argv{std::string(BRISVALE_DOUBLES_DIR) + "/make-volume",
+                                  daemon.Path("/dev/" + bsdName), kind};
+    if (!marker.empty()) argv.push_back(marker);
+    if (RunProgram(argv) != 0) return false;
+  }
+  return true;
+}
+
+plist::Value UsbDevice(const std::string& name, plist::Value child) {
+  return DeviceObject(name, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}}, {std::move(child)});
 }
 
 // A USB device holding one medium that is a whole volume.
 plist::Value Stick(const std::string& bsdName) {
-  return DeviceObject("usb-" + bsdName, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}},
-                      {Medium(bsdName, true, true, "")});
-}
-
-// A USB disk with a GUID partition table: the whole disk, its EFI partition and one data
-// partition, which calls itself not removable like partitions do.
-plist::Value PartitionedStick(const std::string& disk) {
-  plist::Dictionary wholeDisk = *Medium(disk, true, false, "GUID_partition_scheme").dictionary();
-  wholeDisk.set("Children", plist::Array{Medium(disk + "1", false, true, "C12A7328-F81F-11D2-BA4B-00A0C93EC93B"),
-                                         Medium(disk + "2", false, true, "48465300-0000-11AA-AA11-00306543ECAC")});
-  return DeviceObject("usb-" + disk, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}},
-                      {plist::Value(std::move(wholeDisk))});
-}
-
-// A USB device with one still-image interface (protocol 1) or another one.
-plist::Value Camera(const std::string& name, std::optional<int64_t> location, int64_t protocol = 1) {
-  plist::Dictionary interface{{"bInterfaceClass", plist::Value::Int(6)}, {"bInterfaceSubClass", plist::Value::Int(1)},
-                              {"bInterfaceProtocol", plist::Value::Int(protocol)}};
-  if (location) interface.set("locationID", plist::Value::Int(*location));
-  return DeviceObject(name, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}},
-                      {DeviceObject("ptp", "KxUSBHostInterface", std::move(interface))});
+  return UsbDevice("usb-" + bsdName, DeviceObject(bsdName, "KxMedia",
+                                                  {{"BSD Name", plist::Value(bsdName)}, {"Content", plist::Value("")},
+                                                   {"Removable", plist::Value::Bool(true)}, {"Leaf", plist::Value::Bool(true)},
+                                                   {"Writable", plist::Value::Bool(true)}}));
 }
 
 // The type and options of what is mounted at `path` (as seen from outside), or "".
@@ -67,16 +72,17 @@ std::string MountOptions(const std::string& path) {
   return found;
 }
 
-// The "CopyDevices" entry of `node`, or of the camera for "PTPNode".
-std::optional<plist::Dictionary> ListedDevice(SandboxDaemon& daemon, const std::string& node) {
-  std::optional<plist::Value> reply;
-  if (!daemon.SendRequest(plist::Dictionary{{"RequestType", "CopyDevices"}}, &reply).ok() || !reply) return {};
-  const plist::Value* list = reply->get("EntryList");
-  for (const plist::Value& entry : list && list->array() ? *list->array() : plist::Array{}) {
-    const std::string* key = entry.getString(node == "PTPNode" ? "DeviceType" : "DeviceNode");
-    if (key && *key == (node == "PTPNode" ? "PTPCamera" : node)) return *entry.dictionary();
+// How long after `start` the count the daemon exports for the launcher first equals
+// `expected`; none within `limit`.
+std::optional<Clock::duration> TimeUntilCount(const SandboxDaemon& daemon, int32_t expected,
+                                              Clock::time_point start, Clock::duration limit) {
+  for (;;) {
+    std::ifstream file(daemon.Path("/private/var/run/vexa/brisvale-mounterd.transactions"), std::ios::binary);
+    int32_t count = -1;
+    if (file.read(reinterpret_cast<char*>(&count), sizeof count) && count == expected) return Clock::now() - start;
+    if (Clock::now() - start > limit) return std::nullopt;
+    std::this_thread::sleep_for(5ms);
   }
-  return {};
 }
 
 // Waits up to two seconds for `text` in the file at `path`.
@@ -88,100 +94,60 @@ bool WaitForText(const std::string& path, const std::string& text) {
   return false;
 }
 
-struct MediaTest : ::testing::Test {
-  void SetUp() override {
-    BRISVALE_REQUIRE_ROOT();
-    ASSERT_TRUE(InstallToolDoubles(daemon));
-  }
-  // Starts the daemon over the simulated `volumes` ({bsdName, kind, marker}) and `devices`.
-  void Start(const std::vector<std::array<std::string, 3>>& volumes, plist::Array devices) {
-    for (const auto& [bsdName, kind, marker] : volumes) ASSERT_TRUE(PlaceVolume(daemon, bsdName, kind, marker));
-    WriteDevices(std::move(devices));
-    ASSERT_TRUE(daemon.Start({"--devices", "/devices.plist"}));
-  }
-  void WriteDevices(plist::Array objects) {
+TEST(RemovableMediaTest, MountedOnRequestAndOnEventsHeldAlivePulledAndFailuresShownByTheAgent) {
+  BRISVALE_REQUIRE_ROOT();
+  SandboxDaemon daemon;
+  const auto writeDevices = [&](plist::Array objects) {
     std::ofstream(daemon.Path("/devices.plist"))
         << plist::WriteXml(plist::Dictionary{{"Objects", plist::Value(std::move(objects))}});
-  }
-  SandboxDaemon daemon;
-};
+  };
+  ASSERT_TRUE(PrepareSandbox(daemon, {{"sdb1", "hfs+", "dirty"}, {"sdc1", "hfsx", ""}, {"sde1", "ntfs", ""},
+                                      {"sdf1", "hfs+", "broken"}}));
+  writeDevices({Stick("sdc1")});
+  ASSERT_TRUE(daemon.Start({"--devices", "/devices.plist", "--test-keep-alive-ms", "1500"}));
 
-TEST_F(MediaTest, MountsByRequestWithTheToolDoubles) {
-  ASSERT_NO_FATAL_FAILURE(Start({{"sdb1", "hfs+", ""}, {"sdc1", "hfsx", "dirty"}}, {Stick("sdb1"), Stick("sdc1")}));
-  std::optional<plist::Value> reply;
-  ASSERT_TRUE(daemon.SendRequest(plist::Dictionary{{"RequestType", "Mount"}, {"DeviceType", "MassStorage"},
-                                                   {"DeviceNode", plist::Value("/dev/sdb1")}},
-                                 &reply).ok());
-  EXPECT_EQ(*reply->getString("Status"), "Success");
-  EXPECT_EQ(*reply->getString("MountPath"), "/private/var/mnt/mount1");
-  EXPECT_TRUE(daemon.LogContains("default: Successfully mounted /var/mnt/mount1."));
-  EXPECT_THAT(MountOptions(daemon.Path("/private/var/mnt/mount1")), StartsWith("/dev/sdb1 tmpfs rw,nosuid,nodev"));
-
-  // The client command asks for read-only and prints the mount path.
+  // The client command asks for a read-only mount and prints where it went.
   std::string output;
   EXPECT_EQ(RunProgram({BRISVALE_CTL_PATH, "--root", daemon.root(), "mount-storage", "/dev/sdc1", "--read-only"}, &output), 0);
-  EXPECT_EQ(output, "/private/var/mnt/mount2\n");
-  EXPECT_TRUE(daemon.LogContains("debug: The filesystem at /dev/sdc1 appears to be dirty."));
-  EXPECT_THAT(MountOptions(daemon.Path("/private/var/mnt/mount2")), StartsWith("/dev/sdc1 tmpfs ro,nosuid,nodev"));
-}
+  EXPECT_EQ(output, "/private/var/mnt/mount1\n");
+  EXPECT_THAT(MountOptions(daemon.Path("/private/var/mnt/mount1")), StartsWith("/dev/sdc1 tmpfs ro,nosuid,nodev"));
 
-TEST_F(MediaTest, SticksAndCamerasArePluggedAnnouncedListedAndSticksTakenAwayWhenPulled) {
-  ASSERT_NO_FATAL_FAILURE(Start({{"sdb2", "hfs+", "dirty"}, {"sdc1", "hfsx", ""}, {"sdd1", "fat", ""}},
-                                {PartitionedStick("sdb"), Stick("sdc1"), Stick("sdd1"), Camera("camera-a", 0x14100000),
-                                 Camera("other", 0x14400000, 2), Camera("camera-b", 0x14200000),
-                                 Camera("camera-c", std::nullopt)}));
+  // Each hardware event renews a subscription, which holds one transaction for the
+  // keep-alive interval (the stick is mounted already: the events find nothing to do).
+  constexpr auto kInterval = 1500ms;
+  ASSERT_TRUE(TimeUntilCount(daemon, 0, Clock::now(), 10s));  // the start-up subscriptions' end first
+  const Clock::time_point posted = Clock::now();
+  ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
+  ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.mobile.ptp_camera").ok());
+  ASSERT_TRUE(TimeUntilCount(daemon, 2, posted, kInterval)) << "the count never reached 2";
+  const auto fell = TimeUntilCount(daemon, 0, posted, 10 * kInterval);
+  ASSERT_TRUE(fell) << "the count never fell back";
+  EXPECT_GE(*fell, kInterval - 100ms) << "released before its interval";
+
+  // Plugged in: the dirty stick is repaired and mounted read/write, the stick mounted
+  // already is left alone, and the camera is announced.
   std::string error;
   const auto subscriber = notify::Subscriber::Create(daemon.Path("/private/var/run/vexa/notify"), &error);
   ASSERT_TRUE(subscriber) << error;
-  // The notifications that arrived within a short while, with their payloads.
-  const auto received = [&] {
-    std::vector<std::pair<std::string, plist::Value>> all;
+  const auto received = [&] {  // what arrived within a short while
+    Notifications all;
     while (auto n = subscriber->Receive(300ms)) all.emplace_back(n->name, n->userInfo ? plist::Value(*n->userInfo) : plist::Value());
     return all;
   };
-  const auto camera = [](int64_t location) {
-    return std::pair{std::string("com.vantrel.mobile.camera_attached"),
-                     plist::Value(plist::Dictionary{{"LocationID", plist::Value::Int(location)},
-                                                    {"DeviceType", plist::Value("PTPCamera")}})};
-  };
-  const std::pair<std::string, plist::Value> mounted{"com.vantrel.brisvale_mounted", plist::Value()};
+  const plist::Dictionary camera{{"LocationID", plist::Value::Int(0x14100000)}, {"DeviceType", plist::Value("PTPCamera")}};
+  const plist::Dictionary stillImage{{"bInterfaceClass", plist::Value::Int(6)}, {"bInterfaceSubClass", plist::Value::Int(1)},
+                                     {"bInterfaceProtocol", plist::Value::Int(1)}, {"locationID", plist::Value::Int(0x14100000)}};
+  writeDevices({Stick("sdb1"), Stick("sdc1"),
+                UsbDevice("camera", DeviceObject("ptp", "KxUSBHostInterface", stillImage))});
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.mobile.ptp_camera").ok());
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
   ASSERT_TRUE(daemon.WaitForLogLine("default: Successfully mounted /var/mnt/mount2."));
+  EXPECT_EQ(received(), (Notifications{{"com.vantrel.mobile.camera_attached", plist::Value(camera)},
+                                       {"com.vantrel.brisvale_mounted", plist::Value()}}));
+  EXPECT_THAT(MountOptions(daemon.Path("/private/var/mnt/mount2")), StartsWith("/dev/sdb1 tmpfs rw,nosuid,nodev"));
 
-  // Each camera is announced (two mounts and the FAT stick's record follow); the list
-  // holds the last one found.
-  EXPECT_EQ(received(), (std::vector{camera(0x14100000), camera(0x14200000), mounted, mounted, mounted}));
-  EXPECT_TRUE(daemon.LogContains("default: Failed to retrieve locationID."));
-  EXPECT_EQ(ListedDevice(daemon, "PTPNode"), *camera(0x14200000).second.dictionary());
-  EXPECT_TRUE(daemon.LogContains("debug: The attached media sdb is not a leaf, ignoring."));
-  EXPECT_TRUE(daemon.LogContains("debug: Successfully repaired /dev/sdb2."));
-  EXPECT_THAT(MountOptions(daemon.Path("/private/var/mnt/mount1")), StartsWith("/dev/sdb2 "));
-  EXPECT_EQ(*ListedDevice(daemon, "/dev/sdc1").value_or(plist::Dictionary{}).find("MountPath"),
-            plist::Value("/private/var/mnt/mount2"));
-  EXPECT_TRUE(ListedDevice(daemon, "/dev/sdd1")) << "a FAT stick is listed though not mounted";
-
-  // A second event finds the sticks mounted and mounts nothing; the FAT stick, which is
-  // not in the mount table, is recorded again.
-  ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
-  ASSERT_TRUE(daemon.WaitForLogLine("default: /dev/sdc1 is already mounted."));
-  EXPECT_EQ(received(), std::vector{mounted});
-
-  // Pulled without an eject: only that stick's mount and mount point go.
-  WriteDevices({Stick("sdc1"), Stick("sdd1")});
-  ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.detached").ok());
-  ASSERT_TRUE(daemon.WaitForLogLine("default: Posting notification: com.vantrel.brisvale_unmounted"));
-  EXPECT_EQ(received(), (std::vector{std::pair{std::string("com.vantrel.brisvale_unmounted"), plist::Value()}}));
-  EXPECT_FALSE(std::filesystem::exists(daemon.Path("/private/var/mnt/mount1")));
-  EXPECT_EQ(MountOptions(daemon.Path("/private/var/mnt/mount1")), "");
-  EXPECT_NE(MountOptions(daemon.Path("/private/var/mnt/mount2")), "");
-  EXPECT_FALSE(ListedDevice(daemon, "/dev/sdb2"));
-}
-
-// The console agent, `brisvalectl alert-agent`, shows each alert, answers on Enter, and
-// reports the alert of a stick pulled out while it is up as cancelled.
-TEST_F(MediaTest, UnusableSticksRaiseTheirAlertsThroughTheAgent) {
-  ASSERT_NO_FATAL_FAILURE(Start({{"sde1", "ntfs", ""}, {"sdf1", "hfs+", "broken"}}, {}));
+  // The console agent shows each alert and answers on Enter; when every stick is pulled
+  // without an eject, their mounts and mount points go and the alert still up is cancelled.
   const std::string agentOutput = daemon.Path("/agent.out");
   int keyboard[2];
   ASSERT_EQ(pipe2(keyboard, O_CLOEXEC), 0);
@@ -197,21 +163,20 @@ TEST_F(MediaTest, UnusableSticksRaiseTheirAlertsThroughTheAgent) {
   close(keyboard[0]);
   const UniqueFd enter(keyboard[1]);
   EXPECT_TRUE(WaitForText(agentOutput, "\"event\": \"listening\""));
-  WriteDevices({Stick("sde1")});
+  writeDevices({Stick("sde1")});
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
-  EXPECT_TRUE(daemon.WaitForLogLine("default: Failed to mount /dev/sde1."));
   EXPECT_TRUE(WaitForText(agentOutput, "\"title\": \"Cannot Use Storage Device\""));
-  EXPECT_TRUE(WaitForText(agentOutput, "\"button\": \"OK\""));
   ASSERT_EQ(write(enter.get(), "\n", 1), 1);
   EXPECT_TRUE(WaitForText(agentOutput, "\"event\": \"answered\""));
 
-  WriteDevices({Stick("sdf1")});
+  writeDevices({Stick("sdf1")});
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
-  EXPECT_TRUE(daemon.WaitForLogLine("default: Failed to mount /dev/sdf1: verification failed"));
   EXPECT_TRUE(WaitForText(agentOutput, "\"title\": \"Storage Device Needs Repair\""));
-  WriteDevices({});
+  writeDevices({});
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.detached").ok());
   EXPECT_TRUE(WaitForText(agentOutput, "\"event\": \"cancelled\""));
+  EXPECT_EQ(received(), (Notifications{{"com.vantrel.brisvale_unmounted", plist::Value()}}));
+  EXPECT_TRUE(fs::is_empty(daemon.Path("/private/var/mnt")));
   kill(agent, SIGTERM);
   waitpid(agent, nullptr, 0);
 }

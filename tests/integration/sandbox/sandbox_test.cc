@@ -3,13 +3,12 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <linux/capability.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <functional>
@@ -17,25 +16,14 @@
 #include "base/unique_fd.h"
 #include "loop_mount.h"
 #include "platform/linux/loop_device.h"
-#include "platform/linux/os_system.h"
 #include "sandbox_daemon.h"
-#include "test_files.h"
 
 namespace brisvale::linux_os {
 namespace {
 
 namespace fs = std::filesystem;
 
-// Mount points at or below dir, one entry per mount (stacked mounts count twice).
-std::vector<std::string> MountsBelow(const std::string& dir) {
-  std::vector<os::MountRecord> table;
-  EXPECT_GE(os::ReadWholeMountTable("/proc/self/mountinfo", table), 0);
-  std::vector<std::string> found;
-  for (const os::MountRecord& mount : table) {
-    if (mount.mountedOn == dir || mount.mountedOn.starts_with(dir + "/")) found.push_back(mount.mountedOn);
-  }
-  return found;
-}
+using brisvale::testing::MountPointsBelow;
 
 // Runs body in a forked child (which may chroot) and returns what it reported.
 std::string InChild(const std::function<std::string()>& body) {
@@ -66,21 +54,21 @@ class SandboxRoot : public ::testing::Test {
     if (fs::exists(dir_ + "/" + kSandboxMarker)) {
       EXPECT_TRUE(TeardownSandboxRoot(dir_, &error)) << error;
     }
-    EXPECT_TRUE(MountsBelow(dir_).empty());
+    EXPECT_TRUE(MountPointsBelow(dir_).empty());
   }
   const brisvale::testing::ScratchDir scratch_;
   const std::string dir_ = scratch_.str();
 };
 
-TEST_F(SandboxRoot, ChildSeesAWorkingDeviceLikeRootAndRestartsReuseTheBinds) {
+// A child sees a working device-like root, also after a restart, which reuses the binds.
+// A loop-mounted image below it (attached without autoclear), a bind of an outside
+// directory and a link out: the teardown unmounts and detaches what is below and leaves
+// the rest.
+TEST_F(SandboxRoot, WorksLikeADeviceRootAndTeardownClearsWhatIsInsideAndNothingElse) {
   auto probe = [&] {
     std::string failed = Enter(dir_);
     if (!failed.empty()) return failed;
     std::string error;
-    const UniqueFd null(open("/dev/null", O_WRONLY)), zero(open("/dev/zero", O_RDONLY));
-    if (!null || write(null.get(), "x", 1) != 1) return std::string("/dev/null unusable");
-    unsigned char zeros[4] = {1, 1, 1, 1};
-    if (!zero || read(zero.get(), zeros, 4) != 4 || zeros[0] || zeros[3]) return std::string("/dev/zero");
     for (const char* path : {"/proc/self/exe", "/sys/block", "/bin/sh"}) {
       if (access(path, X_OK) != 0) return std::string("no ") + path;
     }
@@ -91,15 +79,10 @@ TEST_F(SandboxRoot, ChildSeesAWorkingDeviceLikeRootAndRestartsReuseTheBinds) {
   };
   EXPECT_EQ(InChild(probe), "");
   EXPECT_EQ(InChild(probe), "");  // the restart
-  const auto mounts = MountsBelow(dir_);
+  const auto mounts = MountPointsBelow(dir_);
   for (const char* tree : {"/proc", "/sys", "/usr"}) EXPECT_EQ(std::ranges::count(mounts, dir_ + tree), 1) << tree;
   EXPECT_EQ(mounts.size(), 3u);
-}
 
-// A loop-mounted image (attached without autoclear), a bind of an outside directory and
-// a link out: the teardown unmounts and detaches what is below and leaves the rest.
-TEST_F(SandboxRoot, MountsMadeInsideShowOutsideAndTeardownClearsThemAndNothingElse) {
-  ASSERT_EQ(InChild([&] { return Enter(dir_); }), "");
   const brisvale::testing::ScratchDir content, outside;
   std::ofstream(content / "hello") << "world";
   std::string error;
@@ -110,45 +93,29 @@ TEST_F(SandboxRoot, MountsMadeInsideShowOutsideAndTeardownClearsThemAndNothingEl
   ASSERT_EQ(mount(outside.str().c_str(), (dir_ + "/private/var/mnt/held").c_str(), nullptr, MS_BIND, nullptr), 0);
   fs::create_symlink(outside.path(), dir_ + "/private/var/link");
 
-  const std::string loop = InChild([&] {
-    std::string failed = Enter(dir_);
-    if (!failed.empty()) return failed;
-    const UniqueFd backing(open("/var/tmp/image.ext4", O_RDONLY));
-    loop::LoopDevice device;
-    if (!backing || loop::Attach(backing.get(), {}, device) != 0) return std::string("attach failed");
-    const std::string name = device.name();
-    mknod(("/dev/" + name).c_str(), S_IFBLK | 0600, device.deviceNumber());
-    mkdir("/var/mnt/image", 0755);
-    if (mount(("/dev/" + name).c_str(), "/var/mnt/image", "ext4", MS_RDONLY, nullptr) != 0) {
-      return std::string("mount failed");
-    }
-    device.Release();
-    return name;
-  });
-  ASSERT_TRUE(loop.starts_with("loop")) << loop;
+  const UniqueFd backing(open((dir_ + "/private/var/tmp/image.ext4").c_str(), O_RDONLY));
+  loop::LoopDevice device;
+  ASSERT_TRUE(backing && loop::Attach(backing.get(), {}, device) == 0);
+  const std::string loop = device.name();
+  ASSERT_EQ(mkdir((dir_ + "/private/var/mnt/image").c_str(), 0755), 0);
+  ASSERT_EQ(mount(("/dev/" + loop).c_str(), (dir_ + "/private/var/mnt/image").c_str(), "ext4", MS_RDONLY, nullptr), 0);
+  device.Release();
   EXPECT_TRUE(fs::exists(dir_ + "/private/var/mnt/image/hello"));
 
   ASSERT_TRUE(TeardownSandboxRoot(dir_, &error)) << error;
-  EXPECT_TRUE(MountsBelow(dir_).empty());
+  EXPECT_TRUE(MountPointsBelow(dir_).empty());
   EXPECT_FALSE(fs::exists(dir_));
   EXPECT_FALSE(fs::exists("/sys/block/" + loop + "/loop/backing_file")) << "still attached";
   EXPECT_TRUE(fs::exists(outside / "keep"));
-  EXPECT_EQ(access("/usr/bin/sh", X_OK), 0);
-  EXPECT_TRUE(TeardownSandboxRoot(dir_, &error)) << "a second teardown finds nothing to do";
 }
 
+// A directory that cannot be a sandbox root is refused with a clear error and left alone.
 TEST_F(SandboxRoot, BadDirectoriesAreRefusedClearlyAndLeftAlone) {
   const std::string file = dir_ + "/file", sub = dir_ + "/sub";
   std::ofstream(file) << "x";
   // A /var that is not the link: a clear error instead of a half-right root.
   fs::create_directories(sub + "/var");
-  const std::pair<std::string, std::string> cases[] = {{dir_ + "/missing", "No such file or directory"},
-                                                       {file, "is not a directory"},
-                                                       {"", "no sandbox root"},
-                                                       {sub, sub + "/var exists and is not a link"}};
-  for (const auto& [dir, expected] : cases) {
-    EXPECT_NE(InChild([&] { return Enter(dir); }).find(expected), std::string::npos) << dir;
-  }
+  EXPECT_NE(InChild([&] { return Enter(sub); }).find(sub + "/var exists and is not a link"), std::string::npos);
   std::string error;
   EXPECT_FALSE(TeardownSandboxRoot("/", &error));
   EXPECT_NE(error.find("cannot be /"), std::string::npos) << error;
@@ -158,24 +125,9 @@ TEST_F(SandboxRoot, BadDirectoriesAreRefusedClearlyAndLeftAlone) {
   EXPECT_TRUE(TeardownSandboxRoot(dir_ + "/missing", &error)) << error;
   EXPECT_TRUE(TeardownSandboxRoot(sub, &error)) << error;
   EXPECT_FALSE(fs::exists(sub));
-}
 
-TEST_F(SandboxRoot, WithoutPrivilegesNothingIsCreated) {
-  const std::string report = InChild([&] {
-    __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
-    __user_cap_data_struct data[2]{};
-    syscall(SYS_capget, &header, data);
-    data[CAP_MKNOD / 32].effective &= ~(1u << (CAP_MKNOD % 32));
-    if (syscall(SYS_capset, &header, data) != 0) return std::string("capset failed");
-    return Enter(dir_);
-  });
-  EXPECT_NE(report.find("needs root"), std::string::npos) << report;
-  EXPECT_TRUE(fs::is_empty(dir_));
-}
-
-TEST(FilesystemLayout, HostWithoutPrivateVarIsRefused) {
+  // Nor is a host whose /var is not the link to /private/var.
   const std::string resolved = fs::canonical("/var");
-  std::string error;
   EXPECT_EQ(CheckFilesystemLayout(&error), resolved == "/private/var");
   EXPECT_TRUE(resolved == "/private/var" || error.find("/var resolves to " + resolved) != std::string::npos) << error;
 }

@@ -1,4 +1,5 @@
-// The inventory over a registry model and a fake mount table: map entries and lookups.
+// The inventory over a registry model and a fake mount table: which media, mounts and
+// cameras it lists, and the entry each gets.
 #include "inventory/inventory.h"
 
 #include <gmock/gmock.h>
@@ -6,6 +7,7 @@
 
 #include "base/log.h"
 #include "fake_os.h"
+#include "media_records.h"
 #include "plist_printers.h"
 #include "platform/services.h"
 #include "registry/registry_model.h"
@@ -13,49 +15,19 @@
 namespace brisvale {
 namespace {
 
-using ::testing::ElementsAre;
-using ::testing::IsEmpty;
 using ::testing::UnorderedElementsAre;
-
-std::vector<uint8_t> BootSector(std::string_view oemName) {
-  std::vector<uint8_t> header(3 + oemName.size());
-  header[0] = 0xEB, header[1] = 0x3C, header[2] = 0x90;
-  std::copy(oemName.begin(), oemName.end(), header.begin() + 3);
-  return header;
-}
-
-std::vector<uint8_t> HfsPlusHeader() {
-  std::vector<uint8_t> header(1028, 0);
-  header[1024] = 'H', header[1025] = '+', header[1027] = 4;
-  return header;
-}
-
-plist::Dictionary Media(const std::string& bsdName, bool removable, bool leaf = true,
-                        const std::string& content = "0x0C") {
-  return {{"BSD Name", plist::Value(bsdName)},
-          {"Content", plist::Value(content)},
-          {"Removable", plist::Value::Bool(removable)},
-          {"Leaf", plist::Value::Bool(leaf)},
-          {"Writable", plist::Value::Bool(true)}};
-}
+using testing::Medium;
 
 os::MountRecord Mount(std::string from, std::string on, uint32_t flags = 0) {
   return {flags, "ext4", std::move(on), std::move(from)};
 }
 
-class InventoryTest : public ::testing::Test {
- protected:
-  InventoryTest() : services_(Services{&registry, &os}) {
-    usb = registry.Publish(nullptr, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}});
-    internal = registry.Publish(nullptr, "KxAHCIDevice", {});
-  }
-
+struct InventoryTest : ::testing::Test {
   // A disk-image drive with one medium below it, as the loop driver publishes them.
   void AttachImage(const std::string& bsdName, const std::string& imagePath) {
-    const std::string_view path = imagePath;
     auto drive = registry.Publish(nullptr, "KxNimbrelHDDriveInKernel",
-                                  {{"image-path", plist::Value(plist::Bytes(path.begin(), path.end()))}});
-    registry.Publish(drive, "KxMedia", Media(bsdName, false));
+                                  {{"image-path", plist::Value(plist::Bytes(imagePath.begin(), imagePath.end()))}});
+    registry.Publish(drive, "KxMedia", Medium(bsdName, false));
   }
 
   std::optional<MountEntry> Entry(const DeviceMap& map, std::string_view node) {
@@ -65,33 +37,37 @@ class InventoryTest : public ::testing::Test {
 
   registry::RegistryModel registry;
   testing::FakeOs os;
-  registry::ObjectRef usb, internal;
+  ScopedServices services{Services{&registry, &os}};
+  registry::ObjectRef usb = registry.Publish(nullptr, "KxUSBHostDevice", {{"removable", plist::Value::Bool(true)}});
+  registry::ObjectRef internal = registry.Publish(nullptr, "KxAHCIDevice", {});
   log::CaptureSink capture;
-
- private:
-  ScopedServices services_;
 };
 
+// Listed by their own flag or an ancestor's; FAT, exFAT and NTFS as if mounted at their node.
 TEST_F(InventoryTest, RemovableMediaListedByOwnFlagOrAncestor) {
-  registry.Publish(usb, "KxMedia", Media("sdb1", false));       // controller is removable
-  registry.Publish(internal, "KxMedia", Media("vda1", false));  // nothing removable above
-  auto disk = registry.Publish(internal, "KxMedia", Media("sdc", true, /*leaf=*/false, "GUID_partition_scheme"));
-  registry.Publish(disk, "KxMedia", Media("sdc1", true));
-  registry.Publish(disk, "KxMedia", Media("sdc2", true, true, "C12A7328-F81F-11D2-BA4B-00A0C93EC93B"));
-  registry.Publish(disk, "KxMedia", Media("sdc3", true, true, "Vantrel_partition_map"));
-  plist::Dictionary noContent = Media("sdd", true);
+  registry.Publish(usb, "KxMedia", Medium("sdb1", false));       // controller is removable
+  registry.Publish(internal, "KxMedia", Medium("vda1", false));  // nothing removable above
+  auto disk = registry.Publish(internal, "KxMedia", Medium("sdc", true, /*leaf=*/false, "GUID_partition_scheme"));
+  registry.Publish(disk, "KxMedia", Medium("sdc1", true));
+  registry.Publish(disk, "KxMedia", Medium("sdc2", true, true, "C12A7328-F81F-11D2-BA4B-00A0C93EC93B"));
+  registry.Publish(disk, "KxMedia", Medium("sdc3", true, true, "Vantrel_partition_map"));
+  plist::Dictionary noContent = Medium("sdd", true);
   noContent.erase("Content");
   registry.Publish(usb, "KxMedia", noContent);
+  registry.Publish(usb, "KxMedia", Medium("sdf1", true));
+  os.volumeHeaders["/dev/sdf1"] = testing::VolumeHeader("FAT");
 
   const std::optional<DeviceMap> media = CopyAttachedMediaEntries();
   ASSERT_TRUE(media);
   std::vector<std::string> nodes;
   for (const auto& [node, entry] : *media) nodes.push_back(node);
-  EXPECT_THAT(nodes, UnorderedElementsAre("/dev/sdb1", "/dev/sdc1"));
+  EXPECT_THAT(nodes, UnorderedElementsAre("/dev/sdb1", "/dev/sdc1", "/dev/sdf1"));
   EXPECT_EQ(Entry(*media, "/dev/sdb1"), (MountEntry{{"DeviceType", "MassStorage"},
                                                     {"DeviceNode", "/dev/sdb1"},
                                                     {"IsMounted", plist::Value::Bool(false)},
                                                     {"IsReadOnly", plist::Value::Bool(false)}}));
+  EXPECT_EQ(*Entry(*media, "/dev/sdf1")->find("MountPath"), plist::Value("/dev/sdf1"));
+  EXPECT_EQ(*Entry(*media, "/dev/sdf1")->find("FilesystemType"), plist::Value("exfat"));
   EXPECT_TRUE(capture.Contains(log::Level::Debug, "The attached media vda1 is not removable, ignoring."));
   EXPECT_TRUE(capture.Contains(log::Level::Debug, "The attached media sdc is not a leaf, ignoring."));
   EXPECT_TRUE(capture.Contains(log::Level::Debug, "Ignoring EFI partition."));
@@ -99,68 +75,9 @@ TEST_F(InventoryTest, RemovableMediaListedByOwnFlagOrAncestor) {
   EXPECT_TRUE(capture.Contains(log::Level::Default, "The attached media object sdd does not have a 'Content' flag."));
 }
 
-TEST_F(InventoryTest, MediaEntryFormFollowsTheFileSystem) {
-  struct Case {
-    const char* bsdName;
-    std::vector<uint8_t> header;
-    bool synthetic;
-  };
-  const Case cases[] = {
-      {"sdf1", BootSector("MSDOS5.0"), true},
-      {"sdg1", BootSector("EXFAT   "), true},
-      {"sdh1", BootSector("NTFS    "), true},
-      {"sdi1", HfsPlusHeader(), false},
-  };
-  for (const Case& c : cases) {
-    registry.Publish(usb, "KxMedia", Media(c.bsdName, true));
-    os.volumeHeaders[std::string("/dev/") + c.bsdName] = c.header;
-  }
-  const std::optional<DeviceMap> media = CopyAttachedMediaEntries();
-  ASSERT_TRUE(media);
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.bsdName);
-    const std::string node = std::string("/dev/") + c.bsdName;
-    const std::optional<MountEntry> entry = Entry(*media, node);
-    ASSERT_TRUE(entry);
-    if (c.synthetic) {
-      EXPECT_EQ(*entry, (MountEntry{{"DeviceType", "MassStorage"},
-                                    {"DeviceNode", plist::Value(node)},
-                                    {"MountPath", plist::Value(node)},
-                                    {"FilesystemType", "exfat"},
-                                    {"IsMounted", plist::Value::Bool(true)},
-                                    {"IsReadOnly", plist::Value::Bool(false)}}));
-    } else {
-      EXPECT_EQ(*entry->find("IsMounted"), plist::Value::Bool(false));
-      EXPECT_EQ(entry->find("MountPath"), nullptr);
-    }
-  }
-}
-
-TEST_F(InventoryTest, MountRootsArePlainPrefixes) {
-  os.mounts = {Mount("/dev/sdb1", "/private/var/mntx"), Mount("/dev/sdb2", "/private/var/mn"),
-               Mount("/dev/sdb3", "/private/var/mnt/mount1", os::kMountReadOnly),
-               Mount("proc", "/proc"),
-               {os::kMountContentProtection, "hfs", "/private/var/debug_mount/x", "devfs"}};
-  registry.Publish(usb, "KxMedia", Media("sdb1", true));
-  registry.Publish(usb, "KxMedia", Media("sdb3", true));
-
-  const std::optional<DeviceMap> map = CopyMountedFilesystemMap();
-  ASSERT_TRUE(map);
-  std::vector<std::string> nodes;
-  for (const auto& [node, entry] : *map) nodes.push_back(node);
-  EXPECT_THAT(nodes, ElementsAre("/dev/sdb1", "/dev/sdb3", "devfs"));
-  EXPECT_EQ(*Entry(*map, "/dev/sdb3")->find("IsReadOnly"), plist::Value::Bool(true));
-  EXPECT_EQ(Entry(*map, "/dev/sdb1")->find("SupportsContentProtection"), nullptr);
-  EXPECT_EQ(*Entry(*map, "devfs")->find("SupportsContentProtection"), plist::Value::Bool(true));
-  // Neither devfs nor a pseudo file system is looked for in the registry; a device is.
-  EXPECT_THAT(capture.Texts(), ::testing::Contains(
-      "Failed to retrieve the Kx service matching the device node for /dev/sdb2."));
-  EXPECT_FALSE(capture.Contains(log::Level::Default,
-                                "Failed to retrieve the Kx service matching the device node for devfs."));
-  EXPECT_TRUE(capture.Contains(log::Level::Debug, "Skipping /private/var/mn, as we didn't mount it."));
-}
-
-TEST_F(InventoryTest, DiskImageTypeAndSignatureFromMountAndBackingPath) {
+// Only what is mounted below a mount root (a plain prefix) is mapped; disk images get the
+// type their mount path gives and the signature their backing file's path holds.
+TEST_F(InventoryTest, MountedFilesystemMapOfMountRootsAndDiskImages) {
   struct Case {
     const char* bsdName;
     const char* mountPath;
@@ -182,9 +99,13 @@ TEST_F(InventoryTest, DiskImageTypeAndSignatureFromMountAndBackingPath) {
     AttachImage(c.bsdName, c.imagePath);
     os.mounts.push_back(Mount(std::string("/dev/") + c.bsdName, c.mountPath, os::kMountReadOnly));
   }
+  os.mounts.insert(os.mounts.end(), {Mount("/dev/sdb1", "/private/var/mntx"), Mount("/dev/sdb2", "/private/var/mn"),
+                                     Mount("/dev/sdb3", "/private/var/mnt/mount1", os::kMountReadOnly), Mount("proc", "/proc"),
+                                     {os::kMountContentProtection, "hfs", "/private/var/debug_mount/x", "devfs"}});
+  registry.Publish(usb, "KxMedia", Medium("sdb3", true));
   os.mounts.push_back(Mount("/dev/loop9", "/private/var/personalized_demo"));  // not in the registry
   auto driveWithoutPath = registry.Publish(nullptr, "KxNimbrelHDDriveInKernel", {});
-  registry.Publish(driveWithoutPath, "KxMedia", Media("loop8", false));
+  registry.Publish(driveWithoutPath, "KxMedia", Medium("loop8", false));
   os.mounts.push_back(Mount("/dev/loop8", "/private/var/personalized_automation"));
 
   const std::optional<DeviceMap> map = CopyMountedFilesystemMap();
@@ -204,22 +125,33 @@ TEST_F(InventoryTest, DiskImageTypeAndSignatureFromMountAndBackingPath) {
   }
   // A device the registry does not know stays mass storage.
   EXPECT_EQ(*Entry(*map, "/dev/loop9")->find("DeviceType"), plist::Value("MassStorage"));
+  EXPECT_EQ(*Entry(*map, "/dev/sdb3"), (MountEntry{{"DeviceType", "MassStorage"},
+                                                   {"DeviceNode", "/dev/sdb3"},
+                                                   {"MountPath", "/private/var/mnt/mount1"},
+                                                   {"FilesystemType", "ext4"},
+                                                   {"IsMounted", plist::Value::Bool(true)},
+                                                   {"IsReadOnly", plist::Value::Bool(true)}}));
+  EXPECT_TRUE(map->find("/dev/sdb1"));  // "/private/var/mntx" starts like a root
+  EXPECT_FALSE(map->find("/dev/sdb2") || map->find("proc"));
+  EXPECT_EQ(*Entry(*map, "devfs")->find("SupportsContentProtection"), plist::Value::Bool(true));
+  // Neither devfs nor a pseudo file system is looked for in the registry; a device is.
+  EXPECT_THAT(capture.Texts(), ::testing::Contains(
+      "Failed to retrieve the Kx service matching the device node for /dev/sdb2."));
+  EXPECT_FALSE(capture.Contains(log::Level::Default,
+                                "Failed to retrieve the Kx service matching the device node for devfs."));
+  EXPECT_TRUE(capture.Contains(log::Level::Debug, "Skipping /private/var/mn, as we didn't mount it."));
   EXPECT_TRUE(capture.Contains(log::Level::Default,
                                "Failed to get backing image path for /private/var/personalized_automation"));
 }
 
-TEST_F(InventoryTest, CombinedMapPrefersTheMountAndLookupsSeeIt) {
-  registry.Publish(usb, "KxMedia", Media("sdb1", true));
-  registry.Publish(usb, "KxMedia", Media("sdb2", true));
+// (The lookups over this map are tested through the handlers that use them.)
+TEST_F(InventoryTest, CombinedMapPrefersTheMount) {
+  registry.Publish(usb, "KxMedia", Medium("sdb1", true));
+  registry.Publish(usb, "KxMedia", Medium("sdb2", true));
   os.mounts = {Mount("/dev/sdb1", "/private/var/mnt/mount1")};
-  for (int location : {0x14100000, 0x14200000}) {
-    registry.Publish(usb, "KxUSBHostInterface",
-                     {{"bInterfaceClass", plist::Value::Int(6)}, {"bInterfaceSubClass", plist::Value::Int(1)},
-                      {"bInterfaceProtocol", plist::Value::Int(1)}, {"locationID", plist::Value::Int(location)}});
-  }
   registry.Publish(usb, "KxUSBHostInterface",
                    {{"bInterfaceClass", plist::Value::Int(6)}, {"bInterfaceSubClass", plist::Value::Int(1)},
-                    {"bInterfaceProtocol", plist::Value::Int(1)}});
+                    {"bInterfaceProtocol", plist::Value::Int(1)}, {"locationID", plist::Value::Int(0x14200000)}});
 
   const std::optional<DeviceMap> devices = CopyAttachedDevices();
   ASSERT_TRUE(devices);
@@ -227,25 +159,6 @@ TEST_F(InventoryTest, CombinedMapPrefersTheMountAndLookupsSeeIt) {
   EXPECT_EQ(*Entry(*devices, "/dev/sdb1")->find("MountPath"), plist::Value("/private/var/mnt/mount1"));
   EXPECT_EQ(Entry(*devices, "PTPNode"),
             (MountEntry{{"LocationID", plist::Value::Int(0x14200000)}, {"DeviceType", "PTPCamera"}}));
-  EXPECT_TRUE(capture.Contains(log::Level::Default, "Failed to retrieve locationID."));
-
-  EXPECT_EQ(*CopyEntryForMountPath("/private/var/mnt/mount1")->find("DeviceNode"), plist::Value("/dev/sdb1"));
-  EXPECT_FALSE(CopyEntryForMountPath("/private/var/mnt/mount2"));
-  EXPECT_EQ(*CopyMassStorageEntryForDeviceNode("/dev/sdb2")->find("IsMounted"), plist::Value::Bool(false));
-  EXPECT_THAT(*CopyDiskImageEntriesOfType("Developer"), IsEmpty());
-
-  plist::Dictionary reply{{"Status", "Failure"}};
-  HandleCopyDevices(plist::Value(), reply);
-  EXPECT_EQ(*reply.find("Status"), plist::Value("Success"));
-  EXPECT_EQ(reply.find("EntryList")->array()->size(), 3u);
-}
-
-TEST_F(InventoryTest, UnreadableMountTableGivesAnEmptyMap) {
-  os.mountTableError = -EIO;
-  const std::optional<DeviceMap> map = CopyMountedFilesystemMap();
-  ASSERT_TRUE(map);
-  EXPECT_TRUE(map->empty());
-  EXPECT_THAT(capture.Texts(), ElementsAre("Failed to get mount information: 5"));
 }
 
 TEST(SignatureText, TwoDirectoriesAboveTheImage) {
@@ -253,8 +166,6 @@ TEST(SignatureText, TwoDirectoriesAboveTheImage) {
       {"/private/var/run/AB12CD/34EF56/image.img", "AB12CD34EF56"},
       {"/a//b/c.dmg", "ab"},
       {"/a/c.dmg", std::nullopt},
-      {"a/b/c/d.dmg", "bc"},
-      {"a/b/c", std::nullopt},
   };
   for (const auto& [path, text] : cases) EXPECT_EQ(CopySignatureTextFromImagePath(path), text) << path;
 }
