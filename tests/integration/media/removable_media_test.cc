@@ -104,7 +104,7 @@ TEST(RemovableMediaTest, MountedOnRequestAndOnEventsHeldAlivePulledAndFailuresSh
   ASSERT_TRUE(PrepareSandbox(daemon, {{"sdb1", "hfs+", "dirty"}, {"sdc1", "hfsx", ""}, {"sde1", "ntfs", ""},
                                       {"sdf1", "hfs+", "broken"}}));
   writeDevices({Stick("sdc1")});
-  ASSERT_TRUE(daemon.Start({"--devices", "/devices.plist", "--test-keep-alive-ms", "1500"}));
+  ASSERT_TRUE(daemon.Start({"--devices", "/devices.plist", "--test-keep-alive-ms", "3000"}));
 
   // The client command asks for a read-only mount and prints where it went.
   std::string output;
@@ -114,7 +114,7 @@ TEST(RemovableMediaTest, MountedOnRequestAndOnEventsHeldAlivePulledAndFailuresSh
 
   // Each hardware event renews a subscription, which holds one transaction for the
   // keep-alive interval (the stick is mounted already: the events find nothing to do).
-  constexpr auto kInterval = 1500ms;
+  constexpr auto kInterval = 3000ms;  // long enough for both events on a loaded machine
   ASSERT_TRUE(TimeUntilCount(daemon, 0, Clock::now(), 10s));  // the start-up subscriptions' end first
   const Clock::time_point posted = Clock::now();
   ASSERT_TRUE(daemon.PostHardwareEvent("com.vantrel.brisvale_mounter.attached").ok());
