@@ -21,8 +21,7 @@ Bytes Expected(crypto::DigestAlgorithm algorithm, const Bytes& data) {
 // Sizes around the read buffer catch a dropped or repeated last block.
 TEST(DigestImageFile, MatchesOneShotDigestAtBufferBoundaries) {
   testing::ScratchDir dir;
-  for (size_t size : {size_t{0}, size_t{1}, kDigestReadSize - 1, kDigestReadSize,
-                      2 * kDigestReadSize + 7}) {
+  for (size_t size : {size_t{0}, kDigestReadSize - 1, kDigestReadSize, 2 * kDigestReadSize + 7}) {
     Bytes data(size);
     for (size_t i = 0; i < size; ++i) data[i] = static_cast<uint8_t>(i * 31 + size);
     testing::WriteFileBytes(dir / "image", data);
@@ -42,7 +41,6 @@ TEST(DigestImageFile, FailuresLogWhy) {
   std::string missing = (dir / "missing").string();
   struct Case { std::string path; long length; bool withOutput; std::vector<std::string> lines; } cases[] = {
       {image, 32, true, {"Unsupported digest size: 32", "Failed to digest data."}},
-      {image, 0, true, {"Unsupported digest size: 0", "Failed to digest data."}},
       {image, 20, false, {"Invalid input"}},
       {missing, 20, true,
        {"Failed to create file handle for " + missing + ".", "Failed to digest data."}},
