@@ -65,14 +65,11 @@ Bytes Minted(const std::string& issuer, const std::string& subject, const EVP_MD
                                       Bytes(fillerSize, 0x5A));
 }
 
-// A secure-boot leaf of exactly `size` bytes, its filler grown or shrunk to fit.
+// A secure-boot leaf of exactly `size` bytes, over 64 KiB: there every length of the
+// certificate takes three octets, so the size grows with the filler one for one.
 Bytes SecureLeafOfSize(size_t size) {
-  size_t filler = size - 1500;
-  Bytes leaf = Minted("secure-root", "secure-leaf", EVP_sha384(), filler);
-  for (int round = 0; round < 4 && leaf.size() != size; ++round) {
-    filler += size - leaf.size();
-    leaf = Minted("secure-root", "secure-leaf", EVP_sha384(), filler);
-  }
+  const size_t overhead = Minted("secure-root", "secure-leaf", EVP_sha384(), 70000).size() - 70000;
+  Bytes leaf = Minted("secure-root", "secure-leaf", EVP_sha384(), size - overhead);
   EXPECT_EQ(leaf.size(), size);
   return leaf;
 }
@@ -152,13 +149,11 @@ TEST(SignatureVerify, RsaModulusUpTo4096BitsAndTheSetsDigestLength) {
 }
 
 TEST(ComputeDigest, RefusesWhatTheSetCannotProduce) {
-  Bytes data{1, 2, 3}, expected(20);
+  // The digests it can produce are checked by every certificate signature above.
+  const uint8_t data[] = {1, 2, 3};
   uint8_t out[48];
-  EXPECT_EQ(Qor4DecodeComputeDigest(data.data(), 3, out, 20, &kQor4DecodeSecureBootRsa1kSha1), 0);
-  ASSERT_TRUE(crypto::Digest(crypto::DigestAlgorithm::Sha1, data, expected));
-  EXPECT_EQ(Bytes(out, out + 20), expected);
-  EXPECT_EQ(Qor4DecodeComputeDigest(data.data(), 3, out, 48, &kQor4DecodeSecureBootRsa1kSha1), -1);
-  EXPECT_EQ(Qor4DecodeComputeDigest(data.data(), 3, out, 32, &kQor4DecodeSecureBootEc256Sha256), -1);
+  EXPECT_EQ(Qor4DecodeComputeDigest(data, 3, out, 48, &kQor4DecodeSecureBootRsa1kSha1), -1);
+  EXPECT_EQ(Qor4DecodeComputeDigest(data, 3, out, 32, &kQor4DecodeSecureBootEc256Sha256), -1);
 }
 
 // The fixed SHA-1 entry hashes the whole manifest last, once every check has passed.

@@ -21,43 +21,43 @@ TEST(VerifyDeveloperImageSignature, TrustAtTheFixedInstantThenTheSignature) {
   testing::WriteFileBytes(dir / "image", image);
   image[123456] ^= 1;
   testing::WriteFileBytes(dir / "tampered", image);
-  const std::string ca = Pki("developer-ca.pem"), certificate = Pki("developer-signing.pem");
   const std::string missingCa = (dir / "no-ca.pem").string();
   const std::string missingCertificate = (dir / "no-cert.pem").string();
   const Lines untrusted = {"Failed to evaluate trust: 5",
                            "Failed to extract public key from the certificate."};
-  // `lines`: none when the signature is accepted.
+  // `lines`: none when the signature is accepted; `key` signs `image`.
   struct Case {
-    const char* key; std::string certificate; const char* image; std::string ca; Lines lines;
+    std::string certificate = Pki("developer-signing.pem"); Lines lines = {};
+    std::string ca = Pki("developer-ca.pem"); const char* image = "image";
+    const char* key = "developer-signing.key";
   } cases[] = {
-      {"developer-signing.key", certificate, "image", ca, {}},
+      {},
       // Expired long after 2014-04-10: still trusted then.
-      {"developer-signing.key", Pki("developer-signing-expired.pem"), "image", ca, {}},
+      {.certificate = Pki("developer-signing-expired.pem")},
       // Not yet valid at 2014-04-10, though valid today.
-      {"developer-signing.key", Pki("developer-signing-future.pem"), "image", ca, untrusted},
+      {.certificate = Pki("developer-signing-future.pem"), .lines = untrusted},
       // A valid signature from a certificate of another CA.
-      {"foreign-signing.key", Pki("foreign-signing.pem"), "image", ca, untrusted},
-      {"developer-signing.key", certificate, "tampered", ca, {"Failed to validate signature."}},
+      {.certificate = Pki("foreign-signing.pem"), .lines = untrusted, .key = "foreign-signing.key"},
+      {.lines = {"Failed to validate signature."}, .image = "tampered"},
       // Missing files fail before any trust work.
-      {"developer-signing.key", certificate, "image", missingCa,
-       {"Failed to open " + missingCa + ": 2", "Failed to load " + missingCa + ".",
-        "Failed to extract public key from the certificate."}},
-      {"developer-signing.key", missingCertificate, "image", ca,
-       {"Failed to open " + missingCertificate + ": 2",
-        "Failed to load the certificate at " + missingCertificate + "."}},
+      {.lines = {"Failed to open " + missingCa + ": 2", "Failed to load " + missingCa + ".",
+                 "Failed to extract public key from the certificate."},
+       .ca = missingCa},
+      {.certificate = missingCertificate,
+       .lines = {"Failed to open " + missingCertificate + ": 2",
+                 "Failed to load the certificate at " + missingCertificate + "."}},
   };
   for (const Case& c : cases) {
+    SCOPED_TRACE(c.certificate + " " + c.ca);
     const std::string signature = (dir / "signature").string();
     ASSERT_TRUE(testing::RunImgtool({"sign-developer", "--key", Pki(c.key), "--image",
                                      (dir / "image").string(), "-o", signature}));
     const std::optional<plist::Bytes> digest = DigestFileSha1((dir / c.image).string());
     ASSERT_TRUE(digest);
     log::CaptureSink capture;
-    EXPECT_EQ(VerifyDeveloperImageSignature(testing::ReadFileBytes(signature), c.certificate,
-                                            *digest, c.ca),
-              c.lines.empty() ? 0 : -1)
-        << c.certificate << " " << c.ca;
-    EXPECT_EQ(capture.Texts(), c.lines) << c.certificate << " " << c.ca;
+    EXPECT_EQ(VerifyDeveloperImageSignature(testing::ReadFileBytes(signature), c.certificate, *digest, c.ca),
+              c.lines.empty() ? 0 : -1);
+    EXPECT_EQ(capture.Texts(), c.lines);
   }
 }
 
