@@ -88,15 +88,9 @@ TEST(VerifyPersonalizedManifest, ChecksDeviceAndImage) {
 }
 
 TEST(VerifyPersonalizedManifest, UndecodableManifestFailsFirst) {
-  const std::pair<testing::Bytes, const char*> cases[] = {
-      {{}, "Failed to initialize qor4 manifest: 6"},
-      {{0x31, 0x00}, "Failed to initialize qor4 manifest: 2"},
-  };
-  for (const auto& [bytes, line] : cases) {
-    log::CaptureSink capture;
-    EXPECT_EQ(VerifyPersonalizedManifest(bytes, std::vector<uint8_t>(48)), -1);
-    EXPECT_EQ(capture.Texts(), Lines{line});
-  }
+  log::CaptureSink capture;
+  EXPECT_EQ(VerifyPersonalizedManifest(testing::Bytes{0x31, 0x00}, std::vector<uint8_t>(48)), -1);
+  EXPECT_EQ(capture.Texts(), Lines{"Failed to initialize qor4 manifest: 2"});
 }
 
 // Identity numbers stored as reals: only those an integer can hold convert.

@@ -29,8 +29,6 @@ namespace {
 using namespace testing_support;
 using namespace derwriter;
 
-constexpr uint32_t kPdmg = Qor4Code("pdmg");
-
 // A delivered property: its code, its kind (0 manifest, 1 object) and its value's tag.
 using Delivered = std::tuple<uint32_t, uint32_t, DERTag>;
 
@@ -112,8 +110,6 @@ TEST_F(TrustEvaluation, DeliversManifestPropertiesThenObjectInEncodingOrder) {
       {Qor4Code("SDOM"), 0, DERTagInteger},     {Qor4Code("DGST"), 1, DERTagOctetString},
       {Qor4Code("pdnm"), 1, DERTagIA5String},   {Qor4Code("EKEY"), 1, DERTagBoolean}};
   EXPECT_EQ(expected, g_slots.delivered);
-  EXPECT_EQ(1, g_slots.chainCalls);
-  EXPECT_EQ(1, g_slots.signatureCalls);
   EXPECT_TRUE(context_.manifestHashValid);
 
   // The signature is checked over the digest of the body, not of the whole manifest.

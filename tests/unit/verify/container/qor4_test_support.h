@@ -3,6 +3,7 @@
 #pragma once
 
 #include <cstdint>
+#include <cstring>
 #include <vector>
 
 #include "derwriter/der_writer.h"
@@ -11,6 +12,8 @@
 namespace brisvale::testing_support {
 
 using derwriter::Bytes;
+
+inline constexpr uint32_t kPdmg = Qor4Code("pdmg");  // the disk-image object
 
 inline std::vector<Bytes> DefaultManifestProperties() {
   using namespace derwriter;
