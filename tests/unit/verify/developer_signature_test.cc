@@ -1,9 +1,11 @@
-// The developer-image signature check: certificate files, trust at the fixed instant, the RSA signature.
+// The developer-image check: image file digests, the certificate files, trust at the fixed
+// instant and the RSA signature.
 #include "verify/developer_signature.h"
 
 #include <gtest/gtest.h>
 
 #include "base/log.h"
+#include "imgtool/signing.h"
 #include "test_support.h"
 #include "verify/image_digest.h"
 
@@ -14,6 +16,40 @@ using testing::Bytes;
 using testing::Pki;
 using Lines = std::vector<std::string>;
 
+// Sizes around the read buffer catch a dropped or repeated last block.
+TEST(DigestImageFile, MatchesOneShotDigestAtBufferBoundaries) {
+  testing::ScratchDir dir;
+  for (size_t size : {size_t{0}, kDigestReadSize - 1, kDigestReadSize, 2 * kDigestReadSize + 7}) {
+    Bytes data(size);
+    for (size_t i = 0; i < size; ++i) data[i] = static_cast<uint8_t>(i * 31 + size);
+    testing::WriteFileBytes(dir / "image", data);
+    for (auto [length, md] : {std::pair{20L, EVP_sha1()}, std::pair{48L, EVP_sha384()}}) {
+      std::vector<uint8_t> digest;
+      ASSERT_EQ(DigestImageFile((dir / "image").string(), &digest, length), 0) << size;
+      EXPECT_EQ(digest, imgtool::DigestOfBytes(data, md)) << size << " " << length;
+    }
+  }
+}
+
+TEST(DigestImageFile, FailuresLogWhy) {
+  testing::ScratchDir dir;
+  testing::WriteFileBytes(dir / "image", {1, 2, 3});
+  const std::string image = (dir / "image").string(), missing = (dir / "missing").string();
+  struct Case { std::string path; long length; bool withOutput; Lines lines; } cases[] = {
+      {image, 32, true, {"Unsupported digest size: 32", "Failed to digest data."}},
+      {image, 20, false, {"Invalid input"}},
+      {missing, 20, true,
+       {"Failed to create file handle for " + missing + ".", "Failed to digest data."}},
+      {"", 48, true, {"Invalid input.", "Failed to digest data."}},
+  };
+  for (const Case& c : cases) {
+    log::CaptureSink capture;
+    std::vector<uint8_t> digest;
+    EXPECT_EQ(DigestImageFile(c.path, c.withOutput ? &digest : nullptr, c.length), -1);
+    EXPECT_EQ(capture.Texts(), c.lines) << c.path << " " << c.length;
+  }
+}
+
 TEST(VerifyDeveloperImageSignature, TrustAtTheFixedInstantThenTheSignature) {
   testing::ScratchDir dir;
   Bytes image(300000);
@@ -21,58 +57,48 @@ TEST(VerifyDeveloperImageSignature, TrustAtTheFixedInstantThenTheSignature) {
   testing::WriteFileBytes(dir / "image", image);
   image[123456] ^= 1;
   testing::WriteFileBytes(dir / "tampered", image);
-  const std::string ca = Pki("developer-ca.pem"), certificate = Pki("developer-signing.pem");
   const std::string missingCa = (dir / "no-ca.pem").string();
   const std::string missingCertificate = (dir / "no-cert.pem").string();
+  const std::string derCertificate = Pki("developer-ca.der"), longPath(1024, 'a');
+  auto notLoaded = [](const std::string& path) { return "Failed to load the certificate at " + path + "."; };
   const Lines untrusted = {"Failed to evaluate trust: 5",
                            "Failed to extract public key from the certificate."};
-  // `lines`: none when the signature is accepted.
+  // `lines`: none when the signature is accepted; `key` signs `image`.
   struct Case {
-    const char* key; std::string certificate; const char* image; std::string ca; Lines lines;
+    std::string certificate = Pki("developer-signing.pem"); Lines lines = {};
+    std::string ca = Pki("developer-ca.pem"); const char* image = "image";
+    const char* key = "developer-signing.key";
   } cases[] = {
-      {"developer-signing.key", certificate, "image", ca, {}},
+      {},
       // Expired long after 2014-04-10: still trusted then.
-      {"developer-signing.key", Pki("developer-signing-expired.pem"), "image", ca, {}},
+      {.certificate = Pki("developer-signing-expired.pem")},
       // Not yet valid at 2014-04-10, though valid today.
-      {"developer-signing.key", Pki("developer-signing-future.pem"), "image", ca, untrusted},
+      {.certificate = Pki("developer-signing-future.pem"), .lines = untrusted},
       // A valid signature from a certificate of another CA.
-      {"foreign-signing.key", Pki("foreign-signing.pem"), "image", ca, untrusted},
-      {"developer-signing.key", certificate, "tampered", ca, {"Failed to validate signature."}},
+      {.certificate = Pki("foreign-signing.pem"), .lines = untrusted, .key = "foreign-signing.key"},
+      {.lines = {"Failed to validate signature."}, .image = "tampered"},
       // Missing files fail before any trust work.
-      {"developer-signing.key", certificate, "image", missingCa,
-       {"Failed to open " + missingCa + ": 2", "Failed to load " + missingCa + ".",
-        "Failed to extract public key from the certificate."}},
-      {"developer-signing.key", missingCertificate, "image", ca,
-       {"Failed to open " + missingCertificate + ": 2",
-        "Failed to load the certificate at " + missingCertificate + "."}},
+      {.lines = {"Failed to open " + missingCa + ": 2", "Failed to load " + missingCa + ".",
+                 "Failed to extract public key from the certificate."},
+       .ca = missingCa},
+      {.certificate = missingCertificate,
+       .lines = {"Failed to open " + missingCertificate + ": 2", notLoaded(missingCertificate)}},
+      // Not PEM, and a path longer than a path can be.
+      {.certificate = derCertificate,
+       .lines = {"Failed to create certificate with PEM data.", notLoaded(derCertificate)}},
+      {.certificate = longPath, .lines = {"Failed to create string.", notLoaded(longPath)}},
   };
   for (const Case& c : cases) {
+    SCOPED_TRACE(c.certificate + " " + c.ca);
     const std::string signature = (dir / "signature").string();
     ASSERT_TRUE(testing::RunImgtool({"sign-developer", "--key", Pki(c.key), "--image",
                                      (dir / "image").string(), "-o", signature}));
     const std::optional<plist::Bytes> digest = DigestFileSha1((dir / c.image).string());
     ASSERT_TRUE(digest);
     log::CaptureSink capture;
-    EXPECT_EQ(VerifyDeveloperImageSignature(testing::ReadFileBytes(signature), c.certificate,
-                                            *digest, c.ca),
-              c.lines.empty() ? 0 : -1)
-        << c.certificate << " " << c.ca;
-    EXPECT_EQ(capture.Texts(), c.lines) << c.certificate << " " << c.ca;
-  }
-}
-
-TEST(CopyCertificateFromPEMFile, RefusesWhatIsNotAPemCertificate) {
-  testing::ScratchDir dir;
-  testing::WriteFileBytes(dir / "empty", {});
-  const std::pair<std::string, const char*> cases[] = {
-      {Pki("developer-ca.der"), "Failed to create certificate with PEM data."},
-      {(dir / "empty").string(), "Failed to create certificate with PEM data."},
-      {std::string(1024, 'a'), "Failed to create string."},
-  };
-  for (const auto& [path, line] : cases) {
-    log::CaptureSink capture;
-    EXPECT_FALSE(CopyCertificateFromPEMFile(path)) << path;
-    EXPECT_EQ(capture.Texts(), Lines{line}) << path;
+    EXPECT_EQ(VerifyDeveloperImageSignature(testing::ReadFileBytes(signature), c.certificate, *digest, c.ca),
+              c.lines.empty() ? 0 : -1);
+    EXPECT_EQ(capture.Texts(), c.lines);
   }
 }
 

@@ -1,5 +1,5 @@
-// Shared by the container tests: a realistic manifest built with the DER writer, and
-// slot functions that record their calls and return what a test asks for.
+// Shared by the container and disk-image tests: a realistic manifest and container built
+// with the DER writer, and a non-allocating stand-in digest.
 #pragma once
 
 #include <cstdint>
@@ -12,6 +12,8 @@
 namespace brisvale::testing_support {
 
 using derwriter::Bytes;
+
+inline constexpr uint32_t kPdmg = Qor4Code("pdmg");  // the disk-image object
 
 inline std::vector<Bytes> DefaultManifestProperties() {
   using namespace derwriter;
@@ -39,6 +41,16 @@ inline Bytes DefaultContainer() {
                    DefaultManifest(), RestoreInfo({BooleanProperty("RDSK", true)}));
 }
 
+// The context points into `bytes`, which must outlive it.
+inline int InitContainer(const Bytes& bytes, Qor4DecodeContext* context) {
+  return Qor4DecodeInit(bytes.data(), static_cast<uint32_t>(bytes.size()), context);
+}
+
+inline int InitManifest(const Bytes& bytes, Qor4DecodeContext* context) {
+  *context = Qor4DecodeContext{};
+  return Qor4DecodeInitManifest(bytes.data(), static_cast<uint32_t>(bytes.size()), context);
+}
+
 // Non-allocating stand-in digest: FNV-1a, its state repeated over the output.
 inline int FakeDigest(const uint8_t* data, uint32_t length, uint8_t* output,
                       uint32_t outputLength) {
@@ -47,58 +59,5 @@ inline int FakeDigest(const uint8_t* data, uint32_t length, uint8_t* output,
   for (uint32_t i = 0; i < outputLength; i++) output[i] = static_cast<uint8_t>(state >> (8 * (i % 8)));
   return 0;
 }
-
-// What the fake slots do and saw. Tests reset it through Slots().
-struct SlotState {
-  int digestResult = 0, chainResult = 0, signatureResult = 0, certificateResult = 0;
-  bool useRealCertificateEvaluation = false;
-  Bytes certificateProperties;  // what the chain slot hands over as the leaf's constraints
-  int chainCalls = 0, signatureCalls = 0, certificateCalls = 0;
-  uint8_t signedDigest[kQor4MaxDigestLength] = {};
-};
-
-inline SlotState& Slots() {
-  static SlotState state;
-  return state;
-}
-
-inline int SlotComputeDigest(const uint8_t* data, uint32_t length, uint8_t* output,
-                             uint32_t outputLength, const Qor4SecureBootParams*) {
-  return Slots().digestResult != 0 ? Slots().digestResult : FakeDigest(data, length, output, outputLength);
-}
-
-inline int SlotVerifyChain(const uint8_t* chain, uint32_t chainLength, const uint8_t** key,
-                           uint32_t* keyLength, const uint8_t** properties,
-                           uint32_t* propertiesLength, const Qor4SecureBootParams*, void*) {
-  Slots().chainCalls++;
-  if (Slots().chainResult != 0) return Slots().chainResult;
-  *key = chain;
-  *keyLength = chainLength;
-  *properties = Slots().certificateProperties.empty() ? nullptr : Slots().certificateProperties.data();
-  *propertiesLength = static_cast<uint32_t>(Slots().certificateProperties.size());
-  return 0;
-}
-
-inline int SlotVerifySignature(const uint8_t*, uint32_t, const uint8_t*, uint32_t,
-                               const uint8_t* digest, uint32_t digestLength,
-                               const Qor4SecureBootParams*, void*) {
-  Slots().signatureCalls++;
-  std::memcpy(Slots().signedDigest, digest, digestLength);
-  return Slots().signatureResult;
-}
-
-inline int SlotEvaluateCertificateProperties(Qor4DecodeContext* context, void* callbackContext) {
-  Slots().certificateCalls++;
-  if (Slots().useRealCertificateEvaluation) {
-    return Qor4DecodeEvaluateCertificateProperties(context, callbackContext);
-  }
-  return Slots().certificateResult;
-}
-
-inline constexpr Qor4DigestInfo kFakeDigestInfo48 = {48, nullptr, std::nullopt};
-
-inline constexpr Qor4SecureBootParams kFakeParams = {
-    SlotComputeDigest, SlotVerifyChain, SlotVerifySignature, SlotEvaluateCertificateProperties,
-    &kFakeDigestInfo48, nullptr, nullptr};
 
 }  // namespace brisvale::testing_support
