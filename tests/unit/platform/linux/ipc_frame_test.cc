@@ -16,19 +16,13 @@ Bytes Header(uint32_t length) {
   return {uint8_t(length >> 24), uint8_t(length >> 16), uint8_t(length >> 8), uint8_t(length)};
 }
 
-Bytes Framed(const Bytes& payload) {
-  Bytes frame = Header(static_cast<uint32_t>(payload.size()));
-  frame.insert(frame.end(), payload.begin(), payload.end());
-  return frame;
-}
-
-Bytes Binary(const plist::Value& value) { return plist::WriteBinary(value); }
-
 Bytes Concat(std::initializer_list<Bytes> parts) {
   Bytes all;
   for (const Bytes& part : parts) all.insert(all.end(), part.begin(), part.end());
   return all;
 }
+
+Bytes Framed(const Bytes& payload) { return Concat({Header(static_cast<uint32_t>(payload.size())), payload}); }
 
 const plist::Dictionary kFirst{{"RequestType", "CopyDevices"}, {"vexa.id", plist::Value::Int(1)}};
 const plist::Dictionary kSecond{{"Blob", plist::Value(Bytes(70000, 0xAB))}};
@@ -42,8 +36,8 @@ struct Case {
 };
 
 std::vector<Case> Cases() {
-  const Bytes first = Framed(Binary(kFirst));
-  const Bytes second = Framed(Binary(kSecond));
+  const Bytes first = *EncodeFrame(kFirst);
+  const Bytes second = *EncodeFrame(kSecond);
   const std::string xml = plist::WriteXml(plist::Value(kFirst));
   return {
       {"one frame", first, {kFirst}, {}},
@@ -56,8 +50,8 @@ std::vector<Case> Cases() {
       {"all ones length", Header(0xFFFFFFFF), {}, FrameError::TooLong},
       {"garbage payload", Framed(Bytes{'h', 'e', 'l', 'l', 'o'}), {}, FrameError::Undecodable},
       {"xml payload", Framed(Bytes(xml.begin(), xml.end())), {}, FrameError::Undecodable},
-      {"array root", Framed(Binary(plist::Array{"a"})), {}, FrameError::NotDictionary},
-      {"string root", Framed(Binary(plist::Value("text"))), {}, FrameError::NotDictionary},
+      {"array root", Framed(plist::WriteBinary(plist::Array{"a"})), {}, FrameError::NotDictionary},
+      // The bytes after a failure are still fed: a reader that has failed stays failed.
       {"good frame survives a bad one after it", Concat({first, Header(0), first}), {kFirst}, FrameError::ZeroLength},
   };
 }
@@ -71,7 +65,7 @@ struct Outcome {
 Outcome FeedInChunks(const Bytes& input, size_t chunk) {
   FrameReader reader;
   Outcome outcome;
-  for (size_t pos = 0; pos < input.size() && !outcome.error; pos += chunk) {
+  for (size_t pos = 0; pos < input.size(); pos += chunk) {
     const size_t size = std::min(chunk, input.size() - pos);
     auto failure = reader.Feed(std::span<const uint8_t>(input).subspan(pos, size), outcome.frames);
     if (failure) outcome.error = failure->error;
@@ -83,7 +77,6 @@ Outcome FeedInChunks(const Bytes& input, size_t chunk) {
 TEST(FrameReaderTest, SameResultHoweverTheBytesAreSplit) {
   for (const Case& c : Cases()) {
     for (size_t chunk : {c.input.size(), size_t{1}, size_t{3}, size_t{4093}}) {
-      if (chunk == 0) continue;
       SCOPED_TRACE(std::string(c.name) + ", chunks of " + std::to_string(chunk));
       Outcome outcome = FeedInChunks(c.input, chunk);
       EXPECT_EQ(outcome.frames, c.frames);
@@ -95,23 +88,8 @@ TEST(FrameReaderTest, SameResultHoweverTheBytesAreSplit) {
   }
 }
 
-TEST(FrameReaderTest, StaysFailedAfterAnError) {
-  FrameReader reader;
-  std::vector<plist::Dictionary> frames;
-  ASSERT_TRUE(reader.Feed(Header(0), frames));
-  auto again = reader.Feed(Framed(Binary(kFirst)), frames);
-  ASSERT_TRUE(again);
-  EXPECT_EQ(again->error, FrameError::ZeroLength);
-  EXPECT_TRUE(frames.empty());
-}
-
-TEST(FrameReaderTest, EncodedFramesReadBackAndOversizedBodiesAreRefused) {
-  std::optional<Bytes> frame = EncodeFrame(kSecond);
-  ASSERT_TRUE(frame);
-  EXPECT_EQ(FeedInChunks(*frame, 1000).frames, std::vector<plist::Dictionary>{kSecond});
-
-  const plist::Dictionary huge{{"Blob", plist::Value(Bytes(kMaxFramePayload, 0))}};
-  EXPECT_FALSE(EncodeFrame(huge));
+TEST(FrameReaderTest, OversizedBodiesAreNotEncoded) {
+  EXPECT_FALSE(EncodeFrame(plist::Dictionary{{"Blob", plist::Value(Bytes(kMaxFramePayload, 0))}}));
 }
 
 }  // namespace
