@@ -68,12 +68,11 @@ TEST(LogFormat, Conversions) {
 // Hostile values: whatever their size or sharing, a line stays within its bound, ends
 // in the cut mark, keeps whole characters and costs no more than the bound to build.
 TEST(LogFormat, LongValuesAreCutEarly) {
-  const Value shared = Value(plist::Bytes(64 * 1024, 0xAB));
-  const Value thousandReferences = Value(plist::Array(1000, shared));
+  // A million references to one 64 KiB value.
+  const Value nested(plist::Array(1000, Value(plist::Array(1000, Value(plist::Bytes(64 * 1024, 0xAB))))));
   const std::string longText(100000, 'x');
   std::string utf8;
   for (int i = 0; i < 5000; ++i) utf8 += "\xC3\xA9";
-  const Value nested = Value(plist::Array(1000, thousandReferences));
   struct Case {
     const char* name;
     std::string format;
@@ -112,7 +111,6 @@ TEST(LogCapture, RecordsLevelsGatesDebugRestoresWhatWasBeforeAndTakesAnyThread) 
   Log(Level::Debug, "debug on");
   SetDebugEnabled(false);
   Log(Level::Debug, "debug off");
-  Write(Level::Debug, "written directly while off");
   SetDebugEnabled(true);
 
   const std::vector<Line> expected = {{Level::Default, "Invalid request type: Bogus"},

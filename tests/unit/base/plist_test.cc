@@ -66,16 +66,6 @@ TEST(PlistValue, DictionaryKeepsOrderAndReplacesInPlace) {
   EXPECT_EQ(d.size(), 2u);
 }
 
-// Small dictionaries are checked pair by pair (the readers' duplicate-key cases), large
-// ones through sorted keys.
-TEST(PlistValue, FromEntriesRefusesDuplicateKeysInALargeDictionary) {
-  std::vector<Dictionary::Entry> entries;
-  for (int i = 0; i < 100; ++i) entries.emplace_back("k" + std::to_string(i), Value::Int(i));
-  EXPECT_TRUE(Dictionary::FromEntries(entries));
-  entries.emplace_back("k57", Value::Int(0));
-  EXPECT_FALSE(Dictionary::FromEntries(entries));
-}
-
 Value Ints() {
   Array a;
   for (int64_t n : {int64_t{0}, int64_t{1}, int64_t{127}, int64_t{128}, int64_t{255},

@@ -22,18 +22,6 @@ struct Pipe {
   void Fill() { EXPECT_EQ(write(fds[1], "x", 1), 1); }
 };
 
-TEST(RunLoop, PostedTasksRunInOrderFromAnyThread) {
-  RunLoop loop;
-  std::vector<int> seen;
-  for (int i = 0; i < 100; ++i) loop.Post([&seen, i] { seen.push_back(i); });
-  std::thread poster([&] {
-    for (int i = 100; i < 1100; ++i) loop.Post([&seen, i] { seen.push_back(i); });
-  });
-  EXPECT_TRUE(loop.RunUntil([&] { return seen.size() == 1100; }, 5s));
-  poster.join();
-  for (int i = 0; i < 1100; ++i) ASSERT_EQ(seen[i], i);
-}
-
 TEST(RunLoop, RunUntilChecksAfterEachTaskAndTimesOutAndStopEndsRun) {
   RunLoop loop;
   int ran = 0;

@@ -27,19 +27,17 @@ Bytes Framed(const Bytes& payload) { return Concat({Header(static_cast<uint32_t>
 const plist::Dictionary kFirst{{"RequestType", "CopyDevices"}, {"vexa.id", plist::Value::Int(1)}};
 const plist::Dictionary kSecond{{"Blob", plist::Value(Bytes(70000, 0xAB))}};
 
-struct Case {
-  const char* name;
-  Bytes input;
-  std::vector<plist::Dictionary> frames;
-  std::optional<FrameError> error;
-  bool partial = false;
-};
-
-std::vector<Case> Cases() {
+TEST(FrameReaderTest, SameResultHoweverTheBytesAreSplit) {
   const Bytes first = *EncodeFrame(kFirst);
   const Bytes second = *EncodeFrame(kSecond);
   const std::string xml = plist::WriteXml(plist::Value(kFirst));
-  return {
+  const struct {
+    const char* name;
+    Bytes input;
+    std::vector<plist::Dictionary> frames;
+    std::optional<FrameError> error;
+    bool partial = false;
+  } cases[] = {
       {"one frame", first, {kFirst}, {}},
       {"two frames, one large", Concat({first, second}), {kFirst, kSecond}, {}},
       {"header split from nothing", Bytes{0, 0}, {}, {}, true},
@@ -54,35 +52,20 @@ std::vector<Case> Cases() {
       // The bytes after a failure are still fed: a reader that has failed stays failed.
       {"good frame survives a bad one after it", Concat({first, Header(0), first}), {kFirst}, FrameError::ZeroLength},
   };
-}
-
-struct Outcome {
-  std::vector<plist::Dictionary> frames;
-  std::optional<FrameError> error;
-  bool partial;
-};
-
-Outcome FeedInChunks(const Bytes& input, size_t chunk) {
-  FrameReader reader;
-  Outcome outcome;
-  for (size_t pos = 0; pos < input.size(); pos += chunk) {
-    const size_t size = std::min(chunk, input.size() - pos);
-    auto failure = reader.Feed(std::span<const uint8_t>(input).subspan(pos, size), outcome.frames);
-    if (failure) outcome.error = failure->error;
-  }
-  outcome.partial = reader.HasPartialFrame();
-  return outcome;
-}
-
-TEST(FrameReaderTest, SameResultHoweverTheBytesAreSplit) {
-  for (const Case& c : Cases()) {
+  for (const auto& c : cases) {
     for (size_t chunk : {c.input.size(), size_t{1}, size_t{3}, size_t{4093}}) {
       SCOPED_TRACE(std::string(c.name) + ", chunks of " + std::to_string(chunk));
-      Outcome outcome = FeedInChunks(c.input, chunk);
-      EXPECT_EQ(outcome.frames, c.frames);
-      EXPECT_EQ(outcome.error, c.error);
+      FrameReader reader;
+      std::vector<plist::Dictionary> frames;
+      std::optional<FrameError> error;
+      for (size_t pos = 0; pos < c.input.size(); pos += chunk) {
+        const std::span<const uint8_t> piece(c.input.data() + pos, std::min(chunk, c.input.size() - pos));
+        if (auto failure = reader.Feed(piece, frames)) error = failure->error;
+      }
+      EXPECT_EQ(frames, c.frames);
+      EXPECT_EQ(error, c.error);
       if (!c.error) {
-        EXPECT_EQ(outcome.partial, c.partial);
+        EXPECT_EQ(reader.HasPartialFrame(), c.partial);
       }
     }
   }
