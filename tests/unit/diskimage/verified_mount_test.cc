@@ -14,13 +14,9 @@ using ::testing::ElementsAre;
 using testing::kDirectory;
 using testing::kFile;
 using testing::kLink;
+using testing::Medium;
 
 constexpr const char* kImage = "/private/var/stage/image.img";
-
-plist::Dictionary Medium(const std::string& bsdName) {
-  return {{"BSD Name", plist::Value(bsdName)}, {"Content", ""}, {"Removable", plist::Value::Bool(false)},
-          {"Leaf", plist::Value::Bool(true)}};
-}
 
 struct VerifiedMountTest : testing::DiskImageTest {
   VerifiedMountTest() {
