@@ -114,30 +114,6 @@ class DriversTest : public ::testing::Test {
   std::optional<DiskImageServices> services;
 };
 
-TEST_F(DriversTest, LoopHelperAttachesReadOnlyWithItsNameAndDetachesWhenItGoes) {
-  for (const bool legacy : {false, true}) {
-    SCOPED_TRACE(legacy ? "LOOP_SET_FD" : "LOOP_CONFIGURE");
-    const UniqueFd file(open(image.c_str(), O_RDONLY | O_CLOEXEC));
-    loop::AttachOptions options;
-    options.partitionScan = true;
-    options.identifier = "helper-test";
-    options.deviceRoot = devRoot;
-    options.legacyAttach = legacy;
-    {
-      loop::LoopDevice device;
-      ASSERT_EQ(loop::Attach(file.get(), options, device), 0);
-      const std::string sys = "/sys/block/" + device.name();
-      EXPECT_EQ(ReadText(sys + "/ro"), "1");
-      EXPECT_EQ(ReadText(sys + "/loop/partscan"), "1");
-      EXPECT_EQ(ReadText(sys + "/loop/backing_file"), image);
-      std::string identifier;
-      EXPECT_TRUE(loop::ReadIdentifier(device.fd(), identifier) == 0 && identifier == "helper-test");
-      EXPECT_FALSE(fs::exists(devRoot + "/" + device.name()));  // the node made for the open is gone
-    }
-    EXPECT_EQ(AttachedUnderDir(), 0);
-  }
-}
-
 constexpr const char* kId1 = "0F3C2B1A-9D8E-4F7A-B6C5-D4E3F2A1B0C9";
 constexpr const char* kId2 = "1A2B3C4D-5E6F-4071-8293-A4B5C6D7E8F9";
 
@@ -239,7 +215,7 @@ TEST_F(DriversTest, StartUpDetachesOnlyUnmountedImageDevicesOfItsRoot) {
   EXPECT_EQ(ReadText("/sys/block/" + mounted + "/loop/backing_file"), image);
 }
 
-TEST_F(DriversTest, LoopDevicesArePublishedBelowTheirDriveThroughEventsOrARefresh) {
+TEST_F(DriversTest, LoopHelperDevicesArePublishedBelowTheirDriveThroughEventsOrARefresh) {
   auto port = model.CreateNotificationPort().value;
   port->Attach(loop);
   std::vector<std::optional<plist::Value>> matched;  // BSD names
@@ -248,16 +224,27 @@ TEST_F(DriversTest, LoopDevicesArePublishedBelowTheirDriveThroughEventsOrARefres
   };
   auto subscription = model.AddMatchingNotification(*port, MatchKind::FirstMatch, Matching::Class("KxMedia"), collect);
   collect(*subscription.value);
-  const auto attach = [&](const char* identifier, loop::LoopDevice& device) {
+  // Through the loop helper: read-only, partitions scanned, named, its node made only
+  // for the open.
+  const auto attach = [&](const char* identifier, bool legacy, loop::LoopDevice& device) {
     const UniqueFd backing(open(image.c_str(), O_RDONLY | O_CLOEXEC));
     loop::AttachOptions options;
-    options.autoclear = true;
+    options.partitionScan = true;
     options.identifier = identifier;
+    options.deviceRoot = devRoot;
+    options.legacyAttach = legacy;
     ASSERT_EQ(loop::Attach(backing.get(), options, device), 0);
+    const std::string sys = "/sys/block/" + device.name();
+    EXPECT_EQ(ReadText(sys + "/ro"), "1");
+    EXPECT_EQ(ReadText(sys + "/loop/partscan"), "1");
+    EXPECT_EQ(ReadText(sys + "/loop/backing_file"), image);
+    std::string stored;
+    EXPECT_TRUE(loop::ReadIdentifier(device.fd(), stored) == 0 && stored == identifier);
   };
 
   loop::LoopDevice device;
-  ASSERT_NO_FATAL_FAILURE(attach(kId1, device));
+  ASSERT_NO_FATAL_FAILURE(attach(kId1, /*legacy=*/false, device));
+  EXPECT_FALSE(fs::exists(devRoot + "/" + device.name()));
   // The kernel's event reaches the provider through the loop, and the new medium
   // reaches the subscriber through the port.
   ASSERT_TRUE(loop.RunUntil([&] { return std::ranges::count(matched, plist::Value(device.name())) == 1; }, 5s));
@@ -290,12 +277,15 @@ TEST_F(DriversTest, LoopDevicesArePublishedBelowTheirDriveThroughEventsOrARefres
     }
     return done();
   };
-  ASSERT_NO_FATAL_FAILURE(attach("not an identifier", device));
-  ASSERT_TRUE(refreshedUntil([&] { return (media = model.GetMatchingService(Matching::BsdName(device.name()))) != nullptr; }));
-  EXPECT_EQ(SearchProperty(media, "nimbrel-unique-identifier"), std::nullopt)
-      << "a loop device attached by someone else carries no identifier";
-  device.Detach();
+  {
+    loop::LoopDevice other;
+    ASSERT_NO_FATAL_FAILURE(attach("not an identifier", /*legacy=*/true, other));
+    ASSERT_TRUE(refreshedUntil([&] { return (media = model.GetMatchingService(Matching::BsdName(other.name()))) != nullptr; }));
+    EXPECT_EQ(SearchProperty(media, "nimbrel-unique-identifier"), std::nullopt)
+        << "a loop device attached by someone else carries no identifier";
+  }  // the helper detaches what it attached when it goes
   EXPECT_TRUE(refreshedUntil([&] { return media->IsTerminated(); }));
+  EXPECT_EQ(AttachedUnderDir(), 0);
 }
 
 }  // namespace
