@@ -23,15 +23,12 @@ TEST_F(MountLocationsTest, TypeAndSubTypeDecideDirectoryAndNotification) {
   } cases[] = {
       {"Developer", "", "/Developer", "com.vantrel.mobile.developer_image_mounted"},
       {"Factory", "", "/private/var/factory_mount/1000001", "com.vantrel.mobile.factory_image_mounted"},
-      {"Factory", "", "/private/var/factory_mount/1000002", "com.vantrel.mobile.factory_image_mounted"},
       {"Personalized", "DeveloperDiskImage", "/Developer", personalized},
       {"Personalized", "DebugDiskImage", "/private/var/personalized_debug", personalized},
-      {"Personalized", "FactoryDiskImage", "/private/var/personalized_factory/1000003", personalized},
+      {"Personalized", "FactoryDiskImage", "/private/var/personalized_factory/1000002", personalized},
       {"Personalized", "AutomationDiskImage", "/private/var/personalized_automation", personalized},
-      {"Personalized", "ProdAutomationDiskImage", "/private/var/personalized_automation", personalized},
       {"developer", "", "", "Unsupported disk image type: developer"},
       {"Personalized", "DeveloperDiskImageX", "", "Invalid personalized disk image type: DeveloperDiskImageX"},
-      {"Personalized", "developerdiskimage", "", "Invalid personalized disk image type: developerdiskimage"},
       {"Personalized", "DemoDiskImage", "", "Failed to create mount path /private/var/personalized_demo: 13"},
       {"Personalized", "-", "", "Failed to decode qor4 manifest: 3"},
   };
@@ -53,7 +50,7 @@ TEST_F(MountLocationsTest, TypeAndSubTypeDecideDirectoryAndNotification) {
     EXPECT_EQ(location->certificatePath.has_value(), c.type != "Personalized");
   }
   // Fresh directories are opened up to 0755 (mkdtemp makes them 0700).
-  EXPECT_EQ(std::count(os.calls.begin(), os.calls.end(), "chmod /private/var/factory_mount/1000002 493"), 1);
+  EXPECT_EQ(std::count(os.calls.begin(), os.calls.end(), "chmod /private/var/factory_mount/1000001 493"), 1);
 }
 
 TEST_F(MountLocationsTest, MountPointMustBeAnEmptyDirectoryOrACreatableRoot) {
