@@ -84,13 +84,12 @@ TEST_F(VerifiedMountTest, EachStepEndsTheAttemptWithItsLineUndoesWhatItMadeAndCo
        "/private/var/personalized_debug"},
       {"mounted", [](auto&) {}, {"Successfully mounted /Developer"}, {open, "attach", unlink}},
   };
+  os.AddFile(kImage, kFile);
+  const testing::FileTreeOs staged = os;
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
-    os.files.erase("/Developer/stray");
-    os.AddFile(kImage, kFile);
-    os.openedStatus.reset();
-    os.leaseResult = signatureResult = trustCacheResult = 0;
-    os.calls.clear();
+    os = staged;
+    signatureResult = trustCacheResult = 0;
     attachResult = "/dev/loop7";
     capture.Clear();
     c.arrange(*this);
