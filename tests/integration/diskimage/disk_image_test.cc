@@ -36,8 +36,10 @@ void WriteVersion(const fs::path& root, const std::string& version) {
                 "</string></dict></plist>");
 }
 
-bool Imgtool(std::vector<std::string> args) {
+// `forThisDevice` adds the identity of the sandbox's device.
+bool Imgtool(std::vector<std::string> args, bool forThisDevice = false) {
   args.insert(args.begin(), BRISVALE_IMGTOOL);
+  if (forThisDevice) args.insert(args.end(), kDevice.begin(), kDevice.end());
   return RunProgram(args) == 0;
 }
 
@@ -71,12 +73,10 @@ struct DiskImageTest : ::testing::Test {
     fs::create_directories(daemon.Path("/Developer"));
     fs::copy_file(kPki + "/developer-signing.pem", daemon.Path("/System/Library/Tethra/CorvexDebug.pem"));
     fs::copy_file(kPki + "/developer-ca.pem", daemon.Path("/System/Library/Tethra/CorvexCA.pem"));
-    std::vector<std::string> identity = {"identity", "-o", daemon.Path("/private/var/run/vexa/device-identity.plist"),
-                                         "--hash-method", "sha384"};
-    identity.insert(identity.end(), kDevice.begin(), kDevice.end());
     fs::create_directories(daemon.Path("/private/var/run/vexa"));
     fs::create_directories(daemon.Path("/private/var/run/staging"));
-    ASSERT_TRUE(Imgtool(identity));
+    ASSERT_TRUE(Imgtool({"identity", "-o", daemon.Path("/private/var/run/vexa/device-identity.plist"), "--hash-method",
+                         "sha384"}, /*forThisDevice=*/true));
     ASSERT_TRUE(daemon.Start());
     std::string error;
     subscriber = notify::Subscriber::Create(daemon.Path("/private/var/run/vexa/notify"), &error);
@@ -108,9 +108,8 @@ struct DiskImageTest : ::testing::Test {
 
   // A manifest for this device.
   std::string Manifest(const std::string& image, const std::string& subType) {
-    std::vector<std::string> args = {"manifest", "--image", image, "-o", image + ".manifest", "--sub-type", subType};
-    args.insert(args.end(), kDevice.begin(), kDevice.end());
-    EXPECT_TRUE(Imgtool(args));
+    EXPECT_TRUE(Imgtool({"manifest", "--image", image, "-o", image + ".manifest", "--sub-type", subType},
+                        /*forThisDevice=*/true));
     return image + ".manifest";
   }
 
