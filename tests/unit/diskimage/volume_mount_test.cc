@@ -67,7 +67,6 @@ TEST_F(VolumeMountTest, VersionComparison) {
       {"21.04", "21.4.5", false,
        {"Disk Image Product Version: 21.04", "System Product Version: 21.4",
         "System Version Mismatch for /Developer: (System: 21.4 / Image: 21.04)"}},
-      {"21", "21.4.5", false, {imageMissing}},
       {"", "21.4.5", false, {imageMissing}},
       {"21.4", "21", false,
        {"Disk Image Product Version: 21.4",
