@@ -158,6 +158,13 @@ TEST_F(DriversTest, AttachPublishesBeforeReturningAndRefusesWhatItDidNotVerify) 
     EXPECT_EQ(Attach(c.list, c.damage), c.status) << c.line;
     EXPECT_EQ(capture.Texts(), std::vector{c.line});
   }
+  // The verified file's read lease gone (a writer opened it): what was attached goes again.
+  const UniqueFd unleased(open(image.c_str(), O_RDONLY | O_CLOEXEC));
+  const VerifiedFile file{unleased.get(), verified.st_dev, verified.st_ino};
+  log::CaptureSink capture;
+  EXPECT_EQ(AttachAndMountImage(image, owner.mountPoint, &file), std::nullopt);
+  EXPECT_TRUE(capture.Contains(log::Level::Default, image + " was opened for writing after it was verified."));
+  EXPECT_EQ(AttachedUnderDir(), 1);
   // A second name for the verified file would let it be rewritten: refused too.
   fs::create_hard_link(image, dir.str() + "/second-name");
   EXPECT_EQ(Attach(list), 0xe00002e2);
