@@ -1,6 +1,7 @@
-// The loop-device helper, the disk-image controller, the code-integrity service and the
-// image volume mount over real files, loop devices and mounts, and the start-up clean-up
-// of the devices a killed daemon left attached. Needs root; every test skips otherwise.
+// The loop-device helper, the sysfs device provider, the disk-image controller, the
+// code-integrity service and the image volume mount over real files, loop devices and
+// mounts, and the start-up clean-up of the devices a killed daemon left attached.
+// Needs root; every test skips otherwise.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/mount.h>
@@ -14,7 +15,9 @@
 
 #include "base/log.h"
 #include "base/plist.h"
+#include "base/runloop.h"
 #include "base/unique_fd.h"
+#include "diskimage/attach.h"
 #include "diskimage/trust_cache.h"
 #include "diskimage/volume_mount.h"
 #include "loop_mount.h"
@@ -30,6 +33,7 @@
 namespace brisvale::registry {
 namespace {
 
+using namespace std::chrono_literals;
 namespace fs = std::filesystem;
 
 // The first line of a sysfs attribute.
@@ -59,7 +63,7 @@ class DriversTest : public ::testing::Test {
     ASSERT_EQ(mknod((devRoot + "/loop-control").c_str(), S_IFCHR | 0600, makedev(10, 237)), 0);
     std::string error;
     ASSERT_TRUE(brisvale::testing::MakeExt4Image(image, 4, "", &error)) << error;
-    devices = StartSystemDevices(model, nullptr, {devRoot});
+    devices = StartSystemDevices(model, &loop, {devRoot});
     ASSERT_NE(devices, nullptr);
     services.emplace(model, DiskImageServicesOptions{devRoot, dir.str() + "/trust-caches",
                                                      [this] { devices->Rescan(); }});
@@ -97,48 +101,18 @@ class DriversTest : public ::testing::Test {
             {"image-path", plist::Value(plist::Bytes(path.begin(), path.end()))}};
   }
 
-  // The BSD name of the medium published for `identifier`, searched as the daemon does.
-  std::string MediumOf(const std::string& identifier) {
-    std::string name;
-    auto media = model.GetMatchingServices(Matching::Class("KxMedia"));
-    while (ObjectRef medium = media.value->Next()) {
-      const auto found = SearchProperty(medium, "nimbrel-unique-identifier");
-      if (found && found->string() && *found->string() == identifier) name = *medium->Property("BSD Name")->string();
-    }
-    return name;
-  }
+  // The BSD name of the medium published for `identifier`.
+  static std::string MediumOf(const std::string& identifier) { return FindAttachedMedia(identifier).value_or(""); }
 
   brisvale::testing::ScratchDir dir;
   const std::string devRoot = dir.str() + "/dev", image = dir.str() + "/image.ext4";
   ImageDevicesOwner owner{dir.str(), dir.str() + "/mnt"};
+  RunLoop loop;
   RegistryModel model;
+  ScopedServices scoped{Services{&model, &os::SystemOs()}};
   std::unique_ptr<SystemDevices> devices;
   std::optional<DiskImageServices> services;
 };
-
-TEST_F(DriversTest, LoopHelperAttachesReadOnlyWithItsNameAndDetachesWhenItGoes) {
-  for (const bool legacy : {false, true}) {
-    SCOPED_TRACE(legacy ? "LOOP_SET_FD" : "LOOP_CONFIGURE");
-    const UniqueFd file(open(image.c_str(), O_RDONLY | O_CLOEXEC));
-    loop::AttachOptions options;
-    options.partitionScan = true;
-    options.identifier = "helper-test";
-    options.deviceRoot = devRoot;
-    options.legacyAttach = legacy;
-    {
-      loop::LoopDevice device;
-      ASSERT_EQ(loop::Attach(file.get(), options, device), 0);
-      const std::string sys = "/sys/block/" + device.name();
-      EXPECT_EQ(ReadText(sys + "/ro"), "1");
-      EXPECT_EQ(ReadText(sys + "/loop/partscan"), "1");
-      EXPECT_EQ(ReadText(sys + "/loop/backing_file"), image);
-      std::string identifier;
-      EXPECT_TRUE(loop::ReadIdentifier(device.fd(), identifier) == 0 && identifier == "helper-test");
-      EXPECT_FALSE(fs::exists(devRoot + "/" + device.name()));  // the node made for the open is gone
-    }
-    EXPECT_EQ(AttachedUnderDir(), 0);
-  }
-}
 
 constexpr const char* kId1 = "0F3C2B1A-9D8E-4F7A-B6C5-D4E3F2A1B0C9";
 constexpr const char* kId2 = "1A2B3C4D-5E6F-4071-8293-A4B5C6D7E8F9";
@@ -171,7 +145,6 @@ TEST_F(DriversTest, AttachPublishesBeforeReturningAndRefusesWhatItDidNotVerify) 
       {swapped, {}, 0xe00002e2, "Disk image " + other + " is not the file that was verified."},
       {List(kId2, link), {}, kNotFound, "Failed to open disk image " + link + ": 40"},
       {List(kId2, fifo), {}, kBadArgument, "Disk image " + fifo + " is not a regular file."},
-      {List(kId2, dir.str()), {}, kBadArgument, "Disk image " + dir.str() + " is not a regular file."},
       {List(kId2, "image.ext4"), {}, kBadArgument, "Disk image attach refused: bad image path."},
       {List("not-a-uuid", image), {}, kBadArgument, "Disk image attach refused: bad identifier."},
       {List(kId2, image), [](auto& record) { std::memset(record.data() + 16, 0, 8); }, kBadArgument,
@@ -185,6 +158,13 @@ TEST_F(DriversTest, AttachPublishesBeforeReturningAndRefusesWhatItDidNotVerify) 
     EXPECT_EQ(Attach(c.list, c.damage), c.status) << c.line;
     EXPECT_EQ(capture.Texts(), std::vector{c.line});
   }
+  // The verified file's read lease gone (a writer opened it): what was attached goes again.
+  const UniqueFd unleased(open(image.c_str(), O_RDONLY | O_CLOEXEC));
+  const VerifiedFile file{unleased.get(), verified.st_dev, verified.st_ino};
+  log::CaptureSink capture;
+  EXPECT_EQ(AttachAndMountImage(image, owner.mountPoint, &file), std::nullopt);
+  EXPECT_TRUE(capture.Contains(log::Level::Default, image + " was opened for writing after it was verified."));
+  EXPECT_EQ(AttachedUnderDir(), 1);
   // A second name for the verified file would let it be rewritten: refused too.
   fs::create_hard_link(image, dir.str() + "/second-name");
   EXPECT_EQ(Attach(list), 0xe00002e2);
@@ -192,19 +172,13 @@ TEST_F(DriversTest, AttachPublishesBeforeReturningAndRefusesWhatItDidNotVerify) 
 }
 
 TEST_F(DriversTest, TrustCachesAreKeptOrRefusedVolumesMountReadOnlyAndAMismatchUndoesAll) {
-  ScopedServices scoped(Services{&model, &os::SystemOs(), nullptr, nullptr});
-  // Malformed, empty and a directory are refused; only the well-formed one is kept.
+  // A malformed cache is refused; a well-formed one is kept.
   const std::string cachePath = owner.mountPoint + "/.TrustCache", keptDir = dir.str() + "/trust-caches";
   formats::TrustCacheEntry entry;
   entry.hash.fill(7);
   const std::vector<uint8_t> wellFormed = formats::BuildTrustCache({entry});
-  for (const char* contents : std::initializer_list<const char*>{"BVTC", "", nullptr}) {
-    fs::remove_all(cachePath);
-    if (contents) std::ofstream(cachePath) << contents;
-    if (!contents) fs::create_directory(cachePath);
-    EXPECT_EQ(LoadTrustCache(owner.mountPoint), -1) << (contents ? contents : "directory");
-  }
-  fs::remove_all(cachePath);
+  brisvale::testing::WriteFileBytes(cachePath, {'B', 'V', 'T', 'C'});
+  EXPECT_EQ(LoadTrustCache(owner.mountPoint), -1);
   brisvale::testing::WriteFileBytes(cachePath, wellFormed);
   EXPECT_EQ(LoadTrustCache(owner.mountPoint), 0);
   ASSERT_EQ(std::distance(fs::directory_iterator(keptDir), fs::directory_iterator()), 1);
@@ -241,6 +215,79 @@ TEST_F(DriversTest, StartUpDetachesOnlyUnmountedImageDevicesOfItsRoot) {
   EXPECT_EQ(DetachAbandonedImageDevices(dir.str()), 1);
   EXPECT_EQ(AttachedUnderDir(), 1);
   EXPECT_EQ(ReadText("/sys/block/" + mounted + "/loop/backing_file"), image);
+}
+
+TEST_F(DriversTest, LoopHelperDevicesArePublishedBelowTheirDriveThroughEventsOrARefresh) {
+  auto port = model.CreateNotificationPort().value;
+  port->Attach(loop);
+  std::vector<std::optional<plist::Value>> matched;  // BSD names
+  const auto collect = [&](Iterator& it) {
+    while (ObjectRef object = it.Next()) matched.push_back(object->Property("BSD Name"));
+  };
+  auto subscription = model.AddMatchingNotification(*port, MatchKind::FirstMatch, Matching::Class("KxMedia"), collect);
+  collect(*subscription.value);
+  // Through the loop helper: read-only, partitions scanned, named, its node made only
+  // for the open.
+  const auto attach = [&](const char* identifier, bool legacy, loop::LoopDevice& device) {
+    const UniqueFd backing(open(image.c_str(), O_RDONLY | O_CLOEXEC));
+    loop::AttachOptions options;
+    options.partitionScan = true;
+    options.identifier = identifier;
+    options.deviceRoot = devRoot;
+    options.legacyAttach = legacy;
+    ASSERT_EQ(loop::Attach(backing.get(), options, device), 0);
+    const std::string sys = "/sys/block/" + device.name();
+    EXPECT_EQ(ReadText(sys + "/ro"), "1");
+    EXPECT_EQ(ReadText(sys + "/loop/partscan"), "1");
+    EXPECT_EQ(ReadText(sys + "/loop/backing_file"), image);
+    std::string stored;
+    EXPECT_TRUE(loop::ReadIdentifier(device.fd(), stored) == 0 && stored == identifier);
+  };
+
+  loop::LoopDevice device;
+  ASSERT_NO_FATAL_FAILURE(attach(kId1, /*legacy=*/false, device));
+  EXPECT_FALSE(fs::exists(devRoot + "/" + device.name()));
+  // The kernel's event reaches the provider through the loop, and the new medium
+  // reaches the subscriber through the port.
+  ASSERT_TRUE(loop.RunUntil([&] { return std::ranges::count(matched, plist::Value(device.name())) == 1; }, 5s));
+  ObjectRef media = model.GetMatchingService(Matching::BsdName(device.name()));
+  ASSERT_NE(media, nullptr);
+  EXPECT_EQ(media->Property("Leaf"), plist::Value::Bool(true));
+  EXPECT_EQ(media->Property("Writable"), plist::Value::Bool(false));
+  EXPECT_EQ(media->Property("Removable"), plist::Value::Bool(false));
+  EXPECT_EQ(media->Property("Content"), plist::Value(""));
+  auto drive = media->Parent();
+  ASSERT_TRUE(drive.ok());
+  EXPECT_TRUE(drive.value->ConformsTo("KxNimbrelHDDriveInKernel"));
+  EXPECT_EQ(drive.value->Property("image-path"), plist::Value(plist::Bytes(image.begin(), image.end())));
+  EXPECT_EQ(SearchProperty(media, "nimbrel-unique-identifier"), plist::Value(kId1));
+
+  std::vector<uint32_t> messages;
+  auto removal = model.AddInterestNotification(
+      *port, media, [&](const ObjectRef&, uint32_t message) { messages.push_back(message); });
+  device.Detach();
+  ASSERT_TRUE(loop.RunUntil([&] { return !messages.empty(); }, 5s));
+  EXPECT_EQ(messages, std::vector<uint32_t>{kMessageServiceIsTerminated});
+  EXPECT_TRUE(drive.value->IsTerminated());
+
+  // Without running the loop a request's refresh reads the events itself; event delivery
+  // may lag the ioctl slightly, so a request a little later must see the change.
+  const auto refreshedUntil = [&](const std::function<bool()>& done) {
+    for (int attempt = 0; attempt < 50 && !done(); ++attempt) {
+      model.Refresh(RefreshReason::Request);
+      if (!done()) usleep(20000);
+    }
+    return done();
+  };
+  {
+    loop::LoopDevice other;
+    ASSERT_NO_FATAL_FAILURE(attach("not an identifier", /*legacy=*/true, other));
+    ASSERT_TRUE(refreshedUntil([&] { return (media = model.GetMatchingService(Matching::BsdName(other.name()))) != nullptr; }));
+    EXPECT_EQ(SearchProperty(media, "nimbrel-unique-identifier"), std::nullopt)
+        << "a loop device attached by someone else carries no identifier";
+  }  // the helper detaches what it attached when it goes
+  EXPECT_TRUE(refreshedUntil([&] { return media->IsTerminated(); }));
+  EXPECT_EQ(AttachedUnderDir(), 0);
 }
 
 }  // namespace

@@ -131,6 +131,12 @@ inline derwriter::Bytes ManifestOf(std::string_view subType, size_t digestLength
       {{"pdmg", {DataProperty("DGST", Bytes(digestLength, 1)), DataProperty("pdnm", name)}}}));
 }
 
+// An image's medium as the disk-image driver publishes it.
+inline plist::Dictionary Medium(const std::string& bsdName) {
+  return {{"BSD Name", plist::Value(bsdName)}, {"Content", ""}, {"Removable", plist::Value::Bool(false)},
+          {"Leaf", plist::Value::Bool(true)}};
+}
+
 struct DiskImageTest : ::testing::Test {
   FileTreeOs os;
   registry::RegistryModel registry;

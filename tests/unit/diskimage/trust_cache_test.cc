@@ -51,27 +51,20 @@ struct Loader final : registry::UserClient {
 TEST(LoadTrustCacheTest, EachWayItEnds) {
   struct Case {
     const char* name;
-    int openResult, sizeResult, mapResult;
-    bool service;
-    Status openStatus, callStatus;
-    int result;
-    std::string line;  // "" when none
+    int openResult = 0, sizeResult = 0, mapResult = 0;
+    bool service = true;
+    Status openStatus = registry::kSuccess, callStatus = registry::kSuccess;
+    int result = -1;
+    std::string line = "";  // "" when none
   } cases[] = {
-      {"loaded", 0, 0, 0, true, registry::kSuccess, registry::kSuccess, 0, ""},
-      {"no trust cache", -ENOENT, 0, 0, true, registry::kSuccess, registry::kSuccess, 0,
-       "Failed to open /Developer/.TrustCache: 2"},
-      {"unreadable", -EACCES, 0, 0, true, registry::kSuccess, registry::kSuccess, -1,
-       "Failed to open /Developer/.TrustCache: 13"},
-      {"fstat fails", 0, -EIO, 0, true, registry::kSuccess, registry::kSuccess, -1,
-       "Failed to fstat /Developer/.TrustCache: 5"},
-      {"cannot map (empty, a directory)", 0, 0, -EINVAL, true, registry::kSuccess, registry::kSuccess, -1,
-       "Failed to mmap /Developer/.TrustCache."},
-      {"no service", 0, 0, 0, false, registry::kSuccess, registry::kSuccess, -1,
-       "KxServiceGetMatchingService failed."},
-      {"open refused", 0, 0, 0, true, registry::kNotFound, registry::kSuccess, -1,
-       "KxServiceOpen failed: 0x02f0"},
-      {"cache refused", 0, 0, 0, true, registry::kSuccess, registry::kBadArgument, -1,
-       "KxConnectCallMethod failed: 0x02c2"},
+      {.name = "loaded", .result = 0},
+      {.name = "no trust cache", .openResult = -ENOENT, .result = 0, .line = "Failed to open /Developer/.TrustCache: 2"},
+      {.name = "unreadable", .openResult = -EACCES, .line = "Failed to open /Developer/.TrustCache: 13"},
+      {.name = "fstat fails", .sizeResult = -EIO, .line = "Failed to fstat /Developer/.TrustCache: 5"},
+      {.name = "cannot map (empty, a directory)", .mapResult = -EINVAL, .line = "Failed to mmap /Developer/.TrustCache."},
+      {.name = "no service", .service = false, .line = "KxServiceGetMatchingService failed."},
+      {.name = "open refused", .openStatus = registry::kNotFound, .line = "KxServiceOpen failed: 0x02f0"},
+      {.name = "cache refused", .callStatus = registry::kBadArgument, .line = "KxConnectCallMethod failed: 0x02c2"},
   };
   for (const Case& c : cases) {
     CacheOs os;

@@ -1,9 +1,8 @@
-// The verified mount pipeline and the attach over fakes: which step ends an
-// attempt, its exact line, what is undone, and that the staged file is always consumed.
+// The verified mount pipeline over fakes: which step ends an attempt, its exact line,
+// what is undone, and that the staged file is always consumed.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "diskimage/attach.h"
 #include "diskimage/verified_mount.h"
 #include "disk_image_fixture.h"
 
@@ -14,13 +13,9 @@ using ::testing::ElementsAre;
 using testing::kDirectory;
 using testing::kFile;
 using testing::kLink;
+using testing::Medium;
 
 constexpr const char* kImage = "/private/var/stage/image.img";
-
-plist::Dictionary Medium(const std::string& bsdName) {
-  return {{"BSD Name", plist::Value(bsdName)}, {"Content", ""}, {"Removable", plist::Value::Bool(false)},
-          {"Leaf", plist::Value::Bool(true)}};
-}
 
 struct VerifiedMountTest : testing::DiskImageTest {
   VerifiedMountTest() {
@@ -88,13 +83,12 @@ TEST_F(VerifiedMountTest, EachStepEndsTheAttemptWithItsLineUndoesWhatItMadeAndCo
        "/private/var/personalized_debug"},
       {"mounted", [](auto&) {}, {"Successfully mounted /Developer"}, {open, "attach", unlink}},
   };
+  os.AddFile(kImage, kFile);
+  const testing::FileTreeOs staged = os;
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
-    os.files.erase("/Developer/stray");
-    os.AddFile(kImage, kFile);
-    os.openedStatus.reset();
-    os.leaseResult = signatureResult = trustCacheResult = 0;
-    os.calls.clear();
+    os = staged;
+    signatureResult = trustCacheResult = 0;
     attachResult = "/dev/loop7";
     capture.Clear();
     c.arrange(*this);
@@ -124,45 +118,6 @@ TEST_F(VerifiedMountTest, DigestComesFromTheVerifiedDescriptorAndFindsAnIdentica
   EXPECT_FALSE(Mount("Personalized", "/private/var/personalized_debug", testing::ManifestOf("DebugDiskImage", 32)).imageDigest);
   EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre("Unsupported digest size: 32", "Failed to digest data.",
                                           "Failed to digest /private/var/stage/image.img."));
-}
-
-// A controller that attaches whatever it is asked to and publishes its media at once.
-struct FakeController : registry::UserClient {
-  FakeController(registry::RegistryModel& registry, std::vector<plist::Dictionary>& requests)
-      : registry(registry), requests(requests) {}
-  registry::Status CallMethod(uint32_t, registry::MethodArgs& args) override {
-    uint64_t location[2] = {};  // address, length
-    std::memcpy(location, args.structIn.data() + 8, sizeof location);
-    const auto request = plist::ReadXml({reinterpret_cast<const uint8_t*>(location[0]), location[1]});
-    requests.push_back(*request->dictionary());
-    auto drive = registry.Publish(nullptr, "KxNimbrelHDDriveInKernel",
-                                  {{"nimbrel-unique-identifier", *request->get("nimbrel-unique-identifier")}});
-    registry.Publish(drive, "KxMedia", Medium("loop" + std::to_string(requests.size())));
-    return registry::kSuccess;
-  }
-  registry::RegistryModel& registry;
-  std::vector<plist::Dictionary>& requests;
-};
-
-TEST_F(VerifiedMountTest, AttachCarriesTheVerifiedIdentityAndStopsWhenTheLeaseWasBroken) {
-  std::vector<plist::Dictionary> requests;
-  registry.SetUserClientFactory(registry.Publish(nullptr, "KxNimbrelController", {}), [&](uint32_t) {
-    return registry::Result<std::unique_ptr<registry::UserClient>>{
-        registry::kSuccess, std::make_unique<FakeController>(registry, requests)};
-  });
-  const VerifiedFile file{3, 7, 42};
-  const auto first = AttachDiskImage(kImage, &file), second = AttachDiskImage(kImage, &file);
-  ASSERT_TRUE(first && second);
-  EXPECT_NE(*first, *second);
-  EXPECT_EQ(FindAttachedMedia(*second), "loop2");
-  EXPECT_EQ(*requests[0].find("image-device"), plist::Value::UInt(7));
-  EXPECT_EQ(*requests[0].find("image-inode"), plist::Value::UInt(42));
-
-  os.AddFile(kImage, kFile);
-  os.leaseHeld = false;
-  EXPECT_FALSE(AttachAndMountImage(kImage, "/Developer", &file));
-  EXPECT_THAT(capture.Texts(log::Level::Default), ElementsAre("/private/var/stage/image.img was opened for writing after it was verified."));
-  EXPECT_THAT(os.calls, ElementsAre("open /dev/loop3", "eject"));
 }
 
 }  // namespace

@@ -57,27 +57,15 @@ TEST_F(ImageJobs, FactoryJobsAreRewrittenAndRefusalsOnlyLogged) {
   EXPECT_EQ(launcher.submitted, std::vector<Dictionary>{expected});
   EXPECT_TRUE(capture.Contains(Level::Debug, "Submitting orbitd job: \n" + Value(expected).description()));
   EXPECT_TRUE(capture.Contains(Level::Default, "JvJobSubmit failed: already loaded: dup"));
+  // So are a personalized image's below the personalized factory root.
+  tree.Write("private/var/personalized_factory/System/Library/OrbitDaemons/j", Value(Job("j", Value("/Developer/x"))));
+  EXPECT_EQ(LoadImageJobs("/private/var/personalized_factory", "Personalized"), 0);
+  EXPECT_EQ(*launcher.submitted.back().find("ProgramArguments"), Value(Array{"/var/personalized_factory/x"}));
 
   tree.Write("private/var/factory_mount/e/Library/OrbitDaemons/j",
              Value(Dictionary{{"Program", "/Developer/x"}, {"ERROR", "from the job"}}));
   EXPECT_EQ(LoadImageJobs("/private/var/factory_mount/e", "Factory"), -1);
   EXPECT_TRUE(capture.Contains(Level::Default, "Failed to copy/fix pist: from the job"));
-}
-
-TEST_F(ImageJobs, RewriteDependsOnTheImageTypeAndMountPoint) {
-  EXPECT_EQ(LoadImageJobs("/Developer", "Developer"), 0);  // no job directories at all
-  const std::pair<const char*, Value> cases[] = {
-      {"Personalized", Value(Array{"/var/personalized_factory/x"})},  // under the personalized factory root
-      {"Developer", Value("/Developer/x")},
-  };
-  for (const auto& [type, program] : cases) {
-    SCOPED_TRACE(type);
-    launcher.submitted.clear();
-    tree.Write("private/var/personalized_factory/System/Library/OrbitDaemons/j", Value(Job("j", Value("/Developer/x"))));
-    EXPECT_EQ(LoadImageJobs("/private/var/personalized_factory", type), 0);
-    ASSERT_EQ(launcher.submitted.size(), 1u);
-    EXPECT_EQ(*launcher.submitted[0].find("ProgramArguments"), program);
-  }
 }
 
 // A job that fails verification stops the scan of its directory, yet the second directory is
