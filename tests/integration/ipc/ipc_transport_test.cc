@@ -137,6 +137,7 @@ class TransportTest : public ::testing::Test {
 
   const brisvale::testing::ScratchDir scratch_;  // outlives the service and its sockets
   IpcOptions options_;
+  std::optional<Client> lingering_;  // still connected when the service goes
   std::unique_ptr<RunLoop> loop_;
   std::unique_ptr<IpcService> service_;
   std::unique_ptr<Listener> listener_;
@@ -161,6 +162,8 @@ TEST_F(TransportTest, EchoesWithThePeerIdentityAndTellsFailuresApart) {
 
   EXPECT_EQ(client->Request({{"Command", "Ignore"}}, 100ms).status, ClientStatus::TimedOut);
   EXPECT_EQ(client->Request({{"Command", "Drop"}}, 3s).status, ClientStatus::Cancelled);
+  lingering_ = Client::Connect(SocketPath());
+  EXPECT_TRUE(lingering_->Request({{"Tag", "b"}}, 3s).ok());
 }
 
 // Two requests in one burst, trickled over about twice the partial-frame timeout and

@@ -1,7 +1,6 @@
 // The Linux mount-table reader: count then fill, decoded paths, the read-only flag.
 #include <gtest/gtest.h>
 #include <sys/mount.h>
-#include <unistd.h>
 
 #include <fstream>
 #include <string>
