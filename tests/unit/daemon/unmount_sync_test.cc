@@ -10,6 +10,7 @@
 #include "base/log.h"
 #include "daemon/request_handlers.h"
 #include "fake_os.h"
+#include "media_records.h"
 #include "platform/services.h"
 #include "platform/system_notify.h"
 #include "registry/registry_model.h"
@@ -59,9 +60,7 @@ struct UnmountSyncTest : ::testing::Test {
                  {os::kMountReadOnly, "ext4", "/Developer", "/dev/loop2"}};
     // Known to the registry but not listed as attached media: only the mounts count.
     for (const char* name : {"sdb1", "loop2"}) {
-      registry.Publish(nullptr, "KxMedia",
-                        {{"BSD Name", name}, {"Content", ""}, {"Removable", plist::Value::Bool(false)},
-                         {"Leaf", plist::Value::Bool(true)}});
+      registry.Publish(nullptr, "KxMedia", testing::Medium(name, false, true, ""));
     }
   }
 

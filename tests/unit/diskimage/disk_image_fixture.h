@@ -13,6 +13,7 @@
 
 #include "base/log.h"
 #include "fake_os.h"
+#include "media_records.h"
 #include "platform/services.h"
 #include "qor4_test_support.h"
 #include "registry/registry_model.h"
@@ -129,12 +130,6 @@ inline derwriter::Bytes ManifestOf(std::string_view subType, size_t digestLength
   return testing_support::DefaultManifest(ManifestBody(
       testing_support::DefaultManifestProperties(),
       {{"pdmg", {DataProperty("DGST", Bytes(digestLength, 1)), DataProperty("pdnm", name)}}}));
-}
-
-// An image's medium as the disk-image driver publishes it.
-inline plist::Dictionary Medium(const std::string& bsdName) {
-  return {{"BSD Name", plist::Value(bsdName)}, {"Content", ""}, {"Removable", plist::Value::Bool(false)},
-          {"Leaf", plist::Value::Bool(true)}};
 }
 
 struct DiskImageTest : ::testing::Test {

@@ -17,7 +17,7 @@ TEST_F(MountRequestTest, EachRefusalLeavesTheFailureReplyAndItsLines) {
   const std::string backing = "/stage/0E76292794/888D4F1FA75FB3AFF4CA27C58F56A6/x.img";
   const auto drive = registry.Publish(nullptr, "KxNimbrelHDDriveInKernel",
                                       {{"image-path", plist::Value(plist::Bytes(backing.begin(), backing.end()))}});
-  registry.Publish(drive, "KxMedia", testing::Medium("loop4"));
+  registry.Publish(drive, "KxMedia", testing::Medium("loop4", false, true, ""));
   os.mounts = {{os::kMountReadOnly, "hfs", "/Developer", "/dev/loop4"}};
   const std::string missing = "/stage/missing.img";
   const struct {
@@ -25,7 +25,6 @@ TEST_F(MountRequestTest, EachRefusalLeavesTheFailureReplyAndItsLines) {
     std::optional<plist::Value> value;  // none: the key is left out
     std::vector<std::string> lines;
   } cases[] = {
-      {"DeviceType", std::nullopt, {"Invalid value for DeviceType: (null)"}},
       {"DeviceType", plist::Value("Camera"), {"Unsupported device type: Camera"}},
       {"DeviceType", plist::Value("MassStorage"), {"Invalid value for DeviceNode: (null)"}},
       {"DiskImageType", plist::Value::Int(1), {"Invalid value for DiskImageType: 1"}},

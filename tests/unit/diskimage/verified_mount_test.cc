@@ -24,7 +24,7 @@ struct VerifiedMountTest : testing::DiskImageTest {
       os.AddFile(dir, kDirectory);
     }
     os.mounts = {{0, "ext4", "/", "/dev/sda1"}};
-    registry.Publish(nullptr, "KxMedia", Medium("sda1"));
+    registry.Publish(nullptr, "KxMedia", Medium("sda1", false, true, ""));
     steps.checkSignature = [this](const VerifiedMountRequest&, std::span<const uint8_t>) { return signatureResult; };
     steps.attachAndMount = [this](std::string_view, std::string_view, const VerifiedFile&) {
       os.calls.push_back("attach");
@@ -103,7 +103,7 @@ TEST_F(VerifiedMountTest, DigestComesFromTheVerifiedDescriptorAndFindsAnIdentica
   const std::string backing = "/stage/0E76292794/888D4F1FA75FB3AFF4CA27C58F56A6/x.img";
   const auto drive = registry.Publish(nullptr, "KxNimbrelHDDriveInKernel",
                                       {{"image-path", plist::Value(plist::Bytes(backing.begin(), backing.end()))}});
-  registry.Publish(drive, "KxMedia", Medium("loop4"));
+  registry.Publish(drive, "KxMedia", Medium("loop4", false, true, ""));
   os.mounts.push_back({os::kMountReadOnly, "ext4", "/private/var/factory_mount/abc", "/dev/loop4"});
   os.AddFile(kImage, kFile);
   const VerifiedMountResult result = Mount("Factory", "/private/var/factory_mount/new");

@@ -7,19 +7,16 @@
 #include <string>
 #include <vector>
 
+#include "derwriter/der_writer.h"
+
 namespace brisvale::ipc {
 namespace {
 
-using Bytes = std::vector<uint8_t>;
+using derwriter::Bytes;
+using derwriter::Concat;
 
 Bytes Header(uint32_t length) {
   return {uint8_t(length >> 24), uint8_t(length >> 16), uint8_t(length >> 8), uint8_t(length)};
-}
-
-Bytes Concat(std::initializer_list<Bytes> parts) {
-  Bytes all;
-  for (const Bytes& part : parts) all.insert(all.end(), part.begin(), part.end());
-  return all;
 }
 
 Bytes Framed(const Bytes& payload) { return Concat({Header(static_cast<uint32_t>(payload.size())), payload}); }

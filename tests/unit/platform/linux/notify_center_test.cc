@@ -1,7 +1,6 @@
 // The notification centre over real datagram sockets in a temporary directory.
 #include <sys/socket.h>
 #include <sys/un.h>
-#include <unistd.h>
 
 #include <gtest/gtest.h>
 
