@@ -87,8 +87,6 @@ TEST_F(UnmountSyncTest, EachStepFailsWithItsLineAndLeavesTheRest) {
   };
   const plist::Dictionary media1{{"MountPath", "/private/var/mnt/media1"}};
   const Case cases[] = {
-      {"unmount: path not text", HandleUnmount, {{"MountPath", plist::Value::Int(3)}}, "", 0, "Failure",
-       {"Invalid value for MountPath: 3"}, 0, 0},
       {"unmount: unknown path", HandleUnmount, {{"MountPath", "/private/var/mnt/other"}}, "", 0, "Failure",
        {"There is no matching entry in the device map for /private/var/mnt/other."}, 0, 0},
       {"unmount refused", HandleUnmount, media1, "force-unmount", -EPERM, "Failure",
@@ -102,7 +100,6 @@ TEST_F(UnmountSyncTest, EachStepFailsWithItsLineAndLeavesTheRest) {
        {"Failed to eject /dev/sdb1 : 19"}, 3, 1},
       {"no device holds the mount", HandleUnmount, media1, "mounted device", -ENODEV, "Success",
        {"Failed to eject /dev/sdb1 : 19"}, 2, 1},
-      {"sync: no path", HandleSync, {}, "", 0, "Failure", {"Failed to extract MountPath from request"}, 0, 0},
       {"sync: unknown path", HandleSync, {{"MountPath", "/private/var/mnt/nothing"}}, "", 0, "Failure",
        {"There is no matching entry for /private/var/mnt/nothing."}, 0, 0},
       {"sync fails", HandleSync, media1, "sync", -EIO, "Failure",

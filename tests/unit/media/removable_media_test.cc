@@ -227,7 +227,6 @@ TEST_F(MediaTest, MountRequestByNodeVolumeToolsPresentPathsAndReadOnlyValue) {
       {"none", {}, {}, "", {"Unknown or unsupported filesystem at /dev/sdb1: [Unknown].", mount}},
       {"FAT", {}, {}, "/dev/sdb1", {"MSDOS FAT filesystem at /dev/sdb1. Skipping mount."}},
       {"EXFAT", {}, {}, "/dev/sdb1", {"MSDOS EXFAT filesystem at /dev/sdb1. Skipping mount."}},
-      {"", {}, {}, "", {"Invalid value for DeviceNode: (null)"}, {}},
       {"", {}, {}, "", {"There is no matching mass storage entry for /dev/sdz9."}, {{"DeviceNode", plist::Value("/dev/sdz9")}}},
       {"HFS+", {}, {}, "/private/var/mnt/mount1", {"Successfully mounted /var/mnt/mount1."},
        With(sdb1, "MountReadOnly", plist::Value::Bool(true)), "rdonly"},
