@@ -71,10 +71,6 @@ ipc::Message Request(const plist::Value& dictionary, bool xml = false, std::opti
 
 plist::Dictionary OfType(plist::Value type) { return {{"RequestType", std::move(type)}}; }
 
-plist::Value AllSPIs() {
-  return plist::Array{"CopyDevices", "MountDevice", "UnmountDevice", "SyncDevice"};
-}
-
 // Each check a request can fail, each request type, and each way an entitlement can
 // fall short: what is logged, and the binary reply routed to the caller, or none.
 TEST(HandleRequest, RejectsOrServesEachRequestWithItsLines) {
@@ -84,7 +80,7 @@ TEST(HandleRequest, RejectsOrServesEachRequestWithItsLines) {
     ipc::Message message;
     std::vector<std::string> lines;
     const char* status = nullptr;  // none: refused without a reply
-    std::optional<plist::Value> allowed = AllSPIs();
+    std::optional<plist::Value> allowed = plist::Array{"CopyDevices", "MountDevice", "UnmountDevice", "SyncDevice"};
   } cases[] = {
       // (A message with no encoded dictionary at all is the serving test's.)
       {"dictionary is text", RequestCarrying("RequestType"), {"Invalid or missing value for EncodedDictionary."}},
