@@ -8,7 +8,6 @@
 #include "base/log.h"
 #include "fake_os.h"
 #include "media_records.h"
-#include "plist_printers.h"
 #include "platform/services.h"
 #include "registry/registry_model.h"
 

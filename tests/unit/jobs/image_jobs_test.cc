@@ -9,7 +9,6 @@
 #include "platform/job_launcher.h"
 #include "platform/linux/os_system.h"
 #include "platform/services.h"
-#include "plist_printers.h"
 
 namespace brisvale {
 namespace {

@@ -7,7 +7,6 @@
 #include <csignal>
 
 #include "job_files.h"
-#include "plist_printers.h"
 
 namespace brisvale::jobs {
 namespace {

@@ -10,7 +10,6 @@
 #include "job_files.h"
 #include "platform/linux/os_system.h"
 #include "platform/services.h"
-#include "plist_printers.h"
 
 namespace brisvale {
 namespace {

@@ -24,7 +24,6 @@
 #include "platform/ipc_service.h"
 #include "platform/services.h"
 #include "platform/system_notify.h"
-#include "plist_printers.h"
 #include "registry/registry_model.h"
 
 namespace brisvale {
