@@ -26,7 +26,6 @@ TEST(IdentifyFilesystem, ClassifiesHeaderBytes) {
     FsType expected;
   };
   const Case cases[] = {
-      {"all zeros", {}, FsTypeUnknown},
       {"short jump, FAT OEM name", {kShortJump, {3, "MSDOS5.0"}}, FsTypeFAT},
       {"long jump, any byte 2", {{0, "\xE9\x11\x22"}}, FsTypeFAT},
       {"NTFS", {kShortJump, {3, "NTFS    "}}, FsTypeNTFS},

@@ -18,7 +18,6 @@ TEST(UsbLocationId, BusInTheTopByteThenOneNibblePerPort) {
       {"2-1.4:1.0", 0x02140000},         // interface of that device
       {"3-1.2.3.4.5.6", 0x03123456},     // six tiers fill the nibbles
       {"3-1.2.3.4.5.6.7", 0x03123456},   // a seventh does not spill over
-      {"1-12", 0x01c00000},
       {"1-20", 0x01f00000},              // above 15: saturated
       {"255-1", 0xff100000},
       {"256-1", std::nullopt},
