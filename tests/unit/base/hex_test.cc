@@ -31,7 +31,6 @@ TEST(Hex, TextToBytes) {
       // the length odd.
       {"non-BMP letter is one pair", "\U0001D400", Bytes{0x05}},
       {"non-BMP letter plus digit has odd length", "\U0001D4001", Bytes{0x05, 0x00}},
-      {"hyphen", "0a-1b", std::nullopt},
       {"embedded NUL", std::string("0\0a", 3), std::nullopt},
       {"multiplication sign between letter ranges", "0\u00D7", std::nullopt},
       {"emoji", "0a\U0001F600", std::nullopt},
