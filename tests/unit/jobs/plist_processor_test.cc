@@ -31,7 +31,6 @@ TEST(PlistProcessor, VerifiesTheProgramAgainstTheRootOfTheMountPoint) {
     Lines logged;
   } cases[] = {
       {Job("a", tool), "/Developer", true, {}},
-      {Job("a", tool), "/private/var/personalized_debug/x", false, {}},
       {Job("a", Args({"/DeveloperTools/x"})), "/Developer", true, {}},  // plain prefix test
       {Job("a", Args({"/private/var/personalized_demo/usr/bin/tool"})), "/var/personalized_demo", true, {}},
       {Job("a", Args({"/private/var/factory_mount/x"})), "/private/var/factory_mount", false, {}},

@@ -15,7 +15,6 @@ TEST(UsbLocationId, BusInTheTopByteThenOneNibblePerPort) {
   const Case cases[] = {
       {"1-0:1.0", 0x01000000},           // root hub interface
       {"2-1.4", 0x02140000},
-      {"2-1.4:1.0", 0x02140000},         // interface of that device
       {"3-1.2.3.4.5.6", 0x03123456},     // six tiers fill the nibbles
       {"3-1.2.3.4.5.6.7", 0x03123456},   // a seventh does not spill over
       {"1-20", 0x01f00000},              // above 15: saturated
