@@ -19,7 +19,6 @@ namespace brisvale {
 namespace {
 
 using ::testing::ElementsAre;
-using ::testing::IsEmpty;
 
 // A connection without a socket: records what the daemon sends and cancels.
 class FakeConnection : public ipc::Connection {
@@ -114,7 +113,7 @@ TEST(HandleRequest, RejectsOrServesEachRequestWithItsLines) {
     EXPECT_EQ(HandleRequest(context, &connection, c.message), c.status != nullptr);
     EXPECT_EQ(capture.Texts(Level::Default), c.lines);
     if (!c.status) {
-      EXPECT_THAT(connection.sent, IsEmpty());
+      EXPECT_TRUE(connection.sent.empty());
       continue;
     }
     ASSERT_EQ(connection.sent.size(), 1u);

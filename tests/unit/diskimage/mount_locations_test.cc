@@ -10,7 +10,6 @@ namespace {
 
 using testing::kDirectory;
 using testing::kFile;
-using testing::kLink;
 using MountLocationsTest = testing::DiskImageTest;
 
 TEST_F(MountLocationsTest, TypeAndSubTypeDecideDirectoryAndNotification) {
@@ -89,7 +88,7 @@ TEST_F(MountLocationsTest, MountPointMustBeAnEmptyDirectoryOrACreatableRoot) {
 TEST_F(MountLocationsTest, OnlyCanonicalLinkFreeExistingPathsAreSafe) {
   for (const char* dir : {"/", "/private", "/private/var", "/private/var/tmp"}) os.AddFile(dir, kDirectory);
   os.AddFile("/private/var/tmp/image.img", kFile);
-  os.AddFile("/var", kLink);
+  os.AddFile("/var", testing::kLink);
   os.AddFile("/private/var/tmp/../tmp/image.img", kFile);
   os.realPaths["/var/tmp/image.img"] = os.realPaths["/private/var/tmp/../tmp/image.img"] = "/private/var/tmp/image.img";
   const std::string tooLong = "/" + std::string(1024, 'a');

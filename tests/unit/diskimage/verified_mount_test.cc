@@ -10,9 +10,7 @@ namespace brisvale {
 namespace {
 
 using ::testing::ElementsAre;
-using testing::kDirectory;
 using testing::kFile;
-using testing::kLink;
 using testing::Medium;
 
 constexpr const char* kImage = "/private/var/stage/image.img";
@@ -21,7 +19,7 @@ struct VerifiedMountTest : testing::DiskImageTest {
   VerifiedMountTest() {
     for (const char* dir : {"/", "/private", "/private/var", "/private/var/stage", "/Developer",
                             "/private/var/personalized_debug"}) {
-      os.AddFile(dir, kDirectory);
+      os.AddFile(dir, testing::kDirectory);
     }
     os.mounts = {{0, "ext4", "/", "/dev/sda1"}};
     registry.Publish(nullptr, "KxMedia", Medium("sda1", false, true, ""));
@@ -56,7 +54,7 @@ TEST_F(VerifiedMountTest, EachStepEndsTheAttemptWithItsLineUndoesWhatItMadeAndCo
   const std::vector<Case> cases = {
       {"missing", [](auto& t) { t.os.files.erase(kImage); },
        {"Failed to lstat /private/var/stage/image.img: 2", "Failed to unlink /private/var/stage/image.img: 2"}, {unlink}},
-      {"a link", [](auto& t) { t.os.AddFile(kImage, kLink); },
+      {"a link", [](auto& t) { t.os.AddFile(kImage, testing::kLink); },
        {"/private/var/stage/image.img is not a regular file (mode: 0xa000)."}, {unlink}},
       {"swapped before the open", [](auto& t) { t.os.openedStatus = os::FileStatus{kFile, 7, 99, 1}; },
        {"/private/var/stage/image.img was replaced while it was opened."}, {open, unlink}},

@@ -14,7 +14,6 @@
 namespace brisvale {
 namespace {
 
-using ::testing::UnorderedElementsAre;
 using testing::Medium;
 
 os::MountRecord Mount(std::string from, std::string on, uint32_t flags = 0) {
@@ -60,7 +59,7 @@ TEST_F(InventoryTest, RemovableMediaListedByOwnFlagOrAncestor) {
   ASSERT_TRUE(media);
   std::vector<std::string> nodes;
   for (const auto& [node, entry] : *media) nodes.push_back(node);
-  EXPECT_THAT(nodes, UnorderedElementsAre("/dev/sdb1", "/dev/sdc1", "/dev/sdf1"));
+  EXPECT_THAT(nodes, ::testing::UnorderedElementsAre("/dev/sdb1", "/dev/sdc1", "/dev/sdf1"));
   EXPECT_EQ(Entry(*media, "/dev/sdb1"), (MountEntry{{"DeviceType", "MassStorage"},
                                                     {"DeviceNode", "/dev/sdb1"},
                                                     {"IsMounted", plist::Value::Bool(false)},

@@ -112,11 +112,9 @@ plist::Dictionary With(plist::Dictionary properties, std::string key, std::optio
 
 struct MediaTest : ::testing::Test {
   MediaTest() {
-    log::SetDebugEnabled(true);
     context.notificationPort = std::move(model.CreateNotificationPort().value);
     context.notificationPort->Attach(loop);
   }
-  ~MediaTest() override { log::SetDebugEnabled(false); }
 
   // Runs the attach handler over one medium with a mount answering the fail* flags and a
   // recording alert; the lines it logged.
