@@ -40,13 +40,6 @@ struct AlertsTest : ::testing::Test {
     std::string error;
     EXPECT_TRUE(alert::InstallLocalizationBundle(root.str(), &error)) << error;
   }
-  // Plays the agent: listens where the service looks for one.
-  UniqueFd Listen() {
-    std::string error;
-    UniqueFd listener = ipc::ListenOnPath(root.str() + alert::kAlertAgentSocketPath, &error);
-    EXPECT_TRUE(listener) << error;
-    return listener;
-  }
   // The agent's end of the next alert's connection, reads bounded by a timeout.
   static UniqueFd Accept(const UniqueFd& listener, int flags = 0) {
     UniqueFd agent(accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC | flags));
@@ -149,7 +142,10 @@ TEST_F(AlertsTest, OneAlertAtATimeUntilWhatTheAgentDoesTakesItDown) {
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
-    UniqueFd listener = Listen();
+    // Plays the agent: listens where the service looks for one.
+    std::string error;
+    UniqueFd listener = ipc::ListenOnPath(root.str() + alert::kAlertAgentSocketPath, &error);
+    ASSERT_TRUE(listener) << error;
     const registry::ObjectRef medium = Medium();
     log.Clear();
     alerts.Show("NO_TEXT_TITLE", "MOUNT_FAILURE_BODY", nullptr, medium);

@@ -39,14 +39,6 @@ class RegistryModelTest : public ::testing::Test {
                             {"bInterfaceProtocol", plist::Value::Int(1)}});
   }
 
-  // A notification whose deliveries are appended to `delivered`.
-  std::unique_ptr<Iterator> Notify(MatchKind kind, const Matching& matching, std::vector<Names>& delivered) {
-    auto added = model.AddMatchingNotification(*port, kind, matching,
-                                               [&delivered](Iterator& it) { delivered.push_back(Drain(it)); });
-    EXPECT_TRUE(added.ok());
-    return std::move(added.value);
-  }
-
   // Runs the loop until the queued deliveries have run.
   void Deliver() { loop.RunFor(20ms); }
 
@@ -104,8 +96,11 @@ TEST_F(RegistryModelTest, ClassesParentsPropertySearchAndTermination) {
 TEST_F(RegistryModelTest, FirstMatchDeliversThroughThePortOnlyAfterTheIteratorIsDrained) {
   port->Attach(loop);
   std::vector<Names> delivered;
-  auto iterator = Notify(MatchKind::FirstMatch, Matching::Class("KxMedia").Set("Leaf", plist::Value::Bool(true)),
-                         delivered);
+  auto added = model.AddMatchingNotification(*port, MatchKind::FirstMatch,
+                                             Matching::Class("KxMedia").Set("Leaf", plist::Value::Bool(true)),
+                                             [&](Iterator& it) { delivered.push_back(Drain(it)); });
+  ASSERT_TRUE(added.ok());
+  std::unique_ptr<Iterator> iterator = std::move(added.value);
   // What matches now is in the returned iterator, not delivered.
   model.Publish(usb, "KxMedia", Media("sdb"));
   Deliver();

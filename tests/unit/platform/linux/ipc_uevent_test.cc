@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include <string>
+#include <vector>
 
 namespace brisvale::ipc {
 namespace {
@@ -13,11 +14,6 @@ using namespace std::string_literals;
 // A kernel datagram: "ACTION@DEVPATH" then KEY=VALUE fields, each NUL-terminated.
 std::string Uevent(const std::string& action, const std::string& subsystem, const std::string& more = "") {
   return action + "@/devices/x\0ACTION="s + action + "\0SUBSYSTEM="s + subsystem + '\0' + more;
-}
-
-std::optional<std::string> Translate(const std::string& datagram) {
-  return MatchingEventForUevent(
-      std::span<const uint8_t>(reinterpret_cast<const uint8_t*>(datagram.data()), datagram.size()));
 }
 
 TEST(KernelDeviceEventTest, TranslatesMediaAndCameraEventsOnly) {
@@ -42,7 +38,7 @@ TEST(KernelDeviceEventTest, TranslatesMediaAndCameraEventsOnly) {
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
-    EXPECT_EQ(Translate(c.datagram), c.event);
+    EXPECT_EQ(MatchingEventForUevent(std::vector<uint8_t>(c.datagram.begin(), c.datagram.end())), c.event);
   }
 }
 
