@@ -15,6 +15,7 @@ printf '[Unit]\nDescription=the unit check\nDefaultDependencies=no\n' >"$units/b
 setsid unshare --pid --fork --mount --propagation private --mount-proc \
   env SYSTEMD_UNIT_PATH="$units" container=brisvale-check \
   /lib/systemd/systemd --system --unit=brisvale-check.target >/dev/null 2>&1 &
+launcher=$!  # unshare, whose one child is the manager
 manager=""
 finish() {
   # Killing the namespace's first process ends every process left in it.
@@ -23,7 +24,7 @@ finish() {
 }
 trap finish EXIT
 for _ in $(seq 100); do
-  manager=$(pgrep -f -x "/lib/systemd/systemd --system --unit=brisvale-check.target" || true)
+  manager=$(pgrep -P "$launcher" || true)
   [[ -n "$manager" ]] && nsenter -t "$manager" -a systemctl is-system-running >/dev/null 2>&1 && break
   sleep 0.1
 done

@@ -52,11 +52,11 @@ int OpenByComponents(const char* path) {
       // A link fails here as "not a directory"; the single call says so only for the
       // last component and "too many links" for one on the way.
       const int error = errno;
-      const bool last = rest.find_first_not_of('/') == std::string_view::npos;
+      if (rest.find_first_not_of('/') == std::string_view::npos) return -error;
       struct stat status {};
       const bool link = ::fstatat(dir.get(), component.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 &&
                         S_ISLNK(status.st_mode);
-      return link && !last ? -ELOOP : -error;
+      return link ? -ELOOP : -error;
     }
     dir = std::move(next);
   }
